@@ -1,0 +1,120 @@
+// VRReportingSession: one reporting session of one client. Its record, lifecycle,
+// message identifiers, message sending and aggregation, telemetry backend session,
+// single messages and the summary sent at stop.
+//
+// start/stop/setServiceType/setConfiguration/updateDefaults are called by the server
+// instance on the server queue; all telemetry work runs on the session's own serial
+// queue, in submission order. Every closure submitted there holds the session.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "base/value.h"
+#include "dispatch/dispatch.h"
+#include "drivers/driver_utility.h"
+#include "platform/telemetry_service.h"
+#include "service/reporting_protocol.h"
+
+namespace vireo {
+
+class ReportingEnvironment;
+
+// The gathered payloads of a running session with the lock that guards them. Each
+// start makes a new one; stop drops it, so a sender that still holds the old one
+// appends to an array nobody reads any more.
+struct AggregatedPayloads {
+  std::mutex lock;
+  Array entries;  // guarded by lock
+};
+
+class VRReportingSession : public std::enable_shared_from_this<VRReportingSession> {
+ public:
+  // initWithID:processIdentifiers:
+  static std::shared_ptr<VRReportingSession> initWithID(std::shared_ptr<ReportingEnvironment> env,
+                                                        std::int64_t reporterID,
+                                                        std::vector<std::int32_t> processIdentifiers);
+  ~VRReportingSession();
+  VRReportingSession(const VRReportingSession&) = delete;
+  VRReportingSession& operator=(const VRReportingSession&) = delete;
+
+  // setServiceType:
+  void setServiceType(std::uint16_t serviceType);
+  // setConfiguration: and updateDefaults: (identical merges into userInfo)
+  void setConfiguration(const Dictionary* configuration);
+  void updateDefaults(const Dictionary* defaults);
+  void start();
+  void stop();
+
+  // sendMessage:category:type:reply: and sendMessage:category:type:sync:reply:
+  void sendMessage(const Dictionary& message, std::uint32_t category, std::uint16_t type, BoolReply reply);
+  void sendMessage(const Dictionary& message, std::uint32_t category, std::uint16_t type, bool sync,
+                   BoolReply reply);
+  // messageIdForCategory:type:
+  std::string messageIdForCategory(std::uint32_t category, std::uint16_t type);
+  // createSummaryEventForSession
+  std::optional<Dictionary> createSummaryEventForSession();
+
+  // sendSingleMessage:category:type:serviceType:userInfo:reply: (class operation)
+  static void sendSingleMessage(const std::shared_ptr<ReportingEnvironment>& env, const Dictionary& message,
+                                std::uint32_t category, std::uint16_t type, std::uint16_t serviceType,
+                                const Dictionary* userInfo, ErrorReply reply);
+
+  // ---- fields ----
+  bool started() const { return started_.load(); }
+  bool skylarkReportingSessionStarted() const { return skylarkReportingSessionStarted_.load(); }
+  std::uint16_t serviceType() const { return serviceType_; }
+  Dictionary userInfo() const;
+  std::shared_ptr<DriverSnapshot> driverSnapShot() const;
+  void setDriverSnapShot(std::shared_ptr<DriverSnapshot> snapshot);
+  BoolReply transactionCompleteBlock() const;
+  void setTransactionCompleteBlock(BoolReply block);
+  std::int64_t reporterID() const { return reporterID_; }
+  const std::vector<std::int32_t>& processIdentifiers() const { return processIdentifiers_; }
+  // The current payload array (absent once stopped).
+  std::shared_ptr<AggregatedPayloads> aggregatedPayloadData() const;
+  Dictionary messageTypeCounts() const;
+  std::string serviceName() const;
+  std::shared_ptr<TelemetrySession> skylarkReportingSession() const;
+  std::shared_ptr<HierarchyToken> skylarkReportingAgentToken() const;
+  const std::shared_ptr<SerialQueue>& skylarkReportingQueue() const { return skylarkReportingQueue_; }
+
+  // Text for log lines ("%@").
+  std::string description() const;
+
+ private:
+  VRReportingSession(std::shared_ptr<ReportingEnvironment> env, std::int64_t reporterID,
+                     std::vector<std::int32_t> processIdentifiers);
+  void startBackendSession(const Dictionary& userInfo, const std::string& serviceName);
+  void deliver(const Dictionary& cleaned, const Dictionary& received, bool submittedWhileStarted,
+               std::uint32_t category, std::uint16_t type);
+
+  const std::shared_ptr<ReportingEnvironment> env_;
+  const std::int64_t reporterID_;
+  const std::vector<std::int32_t> processIdentifiers_;
+  const std::shared_ptr<SerialQueue> skylarkReportingQueue_;
+
+  std::atomic<bool> started_{false};
+  std::atomic<bool> skylarkReportingSessionStarted_{false};
+  std::atomic<std::uint16_t> serviceType_{0xFFFF};
+
+  // Each field below is read and written whole under fieldsLock_; no lock spans
+  // several operations (the server queue orders start, stop and configuration).
+  mutable std::mutex fieldsLock_;
+  Dictionary userInfo_;
+  std::shared_ptr<DriverSnapshot> driverSnapShot_;
+  BoolReply transactionCompleteBlock_;
+  std::shared_ptr<AggregatedPayloads> aggregatedPayloadData_;
+  Dictionary messageTypeCounts_;
+  std::string serviceName_ = "unknown";
+  std::optional<std::string> orientationCallbackID_;
+  std::shared_ptr<TelemetrySession> skylarkReportingSession_;
+  std::shared_ptr<HierarchyToken> skylarkReportingAgentToken_;
+};
+
+}  // namespace vireo
