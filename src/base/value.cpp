@@ -207,6 +207,8 @@ struct Dictionary::Index {
   const Entry* base = nullptr;
 };
 
+void Dictionary::IndexDeleter::operator()(Index* index) const noexcept { delete index; }
+
 Dictionary::Dictionary(std::initializer_list<Entry> entries) {
   for (const auto& e : entries) set(e.first, e.second);
 }
@@ -232,7 +234,7 @@ Dictionary& Dictionary::operator=(Dictionary&& other) noexcept {
 Dictionary::~Dictionary() = default;
 
 void Dictionary::rebuildIndex() const {
-  if (!index_) index_ = std::make_unique<Index>();
+  if (!index_) index_.reset(new Index);
   index_->positions.clear();
   index_->positions.reserve(entries_.size() * 2);
   for (std::size_t i = 0; i < entries_.size(); ++i) index_->positions.emplace(&entries_[i].first, i);

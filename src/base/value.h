@@ -107,8 +107,12 @@ class Dictionary {
 
   const Value* find(const Value& key) const noexcept;
   const Value* find(std::string_view key) const { return find(Value(key)); }
+  const Value* find(const char* key) const { return find(Value(key)); }
+  const Value* find(const std::string& key) const { return find(Value(key)); }
   bool contains(const Value& key) const noexcept { return find(key) != nullptr; }
   bool contains(std::string_view key) const { return find(key) != nullptr; }
+  bool contains(const char* key) const { return find(key) != nullptr; }
+  bool contains(const std::string& key) const { return find(key) != nullptr; }
 
   // Replaces the value of an existing key in place, otherwise appends.
   void set(Value key, Value value);
@@ -120,11 +124,14 @@ class Dictionary {
 
  private:
   struct Index;
+  struct IndexDeleter {
+    void operator()(Index* index) const noexcept;
+  };
   std::size_t indexOf(const Value& key) const noexcept;
   void rebuildIndex() const;
 
   std::vector<Entry> entries_;
-  mutable std::unique_ptr<Index> index_;
+  mutable std::unique_ptr<Index, IndexDeleter> index_;
 };
 
 // JSON writing. Strict mode refuses what strict JSON cannot hold (NaN, infinities,
