@@ -2,6 +2,7 @@
 // computed once per process on first use.
 #pragma once
 
+#include <atomic>
 #include <mutex>
 
 #include "platform/platform.h"
@@ -16,6 +17,10 @@ class ReportingEnvironment {
 
   Platform& platform;
   Logger& logger() const { return platform.logger; }
+
+  // How long a session waits for the telemetry service to find backends before it
+  // logs and waits again; tests shorten it.
+  std::atomic<double> backendWaitInterval{9.0};
 
   // VRReportingIsInternalBuild: the device's "InternalBuild" answer, false without one.
   bool isInternalBuild() {
