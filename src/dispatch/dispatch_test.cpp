@@ -1,0 +1,319 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <fstream>
+#include <future>
+#include <mutex>
+#include <random>
+#include <set>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "dispatch/thread_pool.h"
+
+namespace vireo {
+namespace {
+
+using namespace std::chrono_literals;
+
+int threadsOfProcess() {
+  std::ifstream in("/proc/self/status");
+  std::string line;
+  while (std::getline(in, line)) {
+    if (line.rfind("Threads:", 0) == 0) return std::stoi(line.substr(8));
+  }
+  return -1;
+}
+
+// A countdown that tests can wait on with a deadline, so a fault fails instead of hanging.
+class Countdown {
+ public:
+  explicit Countdown(int n) : left_(n) {}
+  void arrive() {
+    std::lock_guard lock(mu_);
+    if (--left_ <= 0) cv_.notify_all();
+  }
+  bool wait(std::chrono::milliseconds budget = 10s) {
+    std::unique_lock lock(mu_);
+    return cv_.wait_for(lock, budget, [&] { return left_ <= 0; });
+  }
+
+ private:
+  std::mutex mu_;  // guards left_
+  std::condition_variable cv_;
+  int left_;
+};
+
+ThreadPoolDispatcher::Options small(std::size_t workers) {
+  ThreadPoolDispatcher::Options o;
+  o.coreWorkers = workers;
+  return o;
+}
+
+TEST(SerialQueue, RunsClosuresInSubmissionOrder) {
+  ThreadPoolDispatcher pool(small(4));
+  auto q = pool.makeSerialQueue("order", QoS::Default);
+  EXPECT_EQ(q->label(), "order");
+  std::vector<int> seen;  // touched only by the queue's closures
+  for (int i = 0; i < 5000; ++i) q->async([&seen, i] { seen.push_back(i); });
+  ASSERT_TRUE(pool.drain(10s));
+  ASSERT_EQ(seen.size(), 5000u);
+  for (int i = 0; i < 5000; ++i) ASSERT_EQ(seen[i], i);
+}
+
+// Many producers feed many queues; every closure checks that it is alone on its
+// queue and that each producer's sequence numbers arrive in order.
+TEST(SerialQueue, NeverRunsTwoClosuresOfOneQueueAtOnceUnderStress) {
+  constexpr int kQueues = 64, kProducers = 4, kPerProducer = 4000;
+  ThreadPoolDispatcher::Options o = small(4);
+  o.batchSize = 3;  // many hand-overs between workers
+  ThreadPoolDispatcher pool(o);
+  struct State {
+    std::shared_ptr<SerialQueue> queue;
+    std::atomic<int> inFlight{0};
+    int lastSeq[kProducers];
+  };
+  std::vector<State> states(kQueues);
+  for (int i = 0; i < kQueues; ++i) {
+    states[i].queue = pool.makeSerialQueue("q" + std::to_string(i), QoS(i % 5));
+    std::fill(std::begin(states[i].lastSeq), std::end(states[i].lastSeq), -1);
+  }
+  std::atomic<int> overlaps{0}, reorders{0}, ran{0};
+  std::vector<std::thread> producers;
+  for (int p = 0; p < kProducers; ++p) {
+    producers.emplace_back([&, p] {
+      std::mt19937 rng(static_cast<unsigned>(p));
+      for (int seq = 0; seq < kPerProducer; ++seq) {
+        State& s = states[rng() % kQueues];
+        s.queue->async([&s, &overlaps, &reorders, &ran, p, seq] {
+          if (s.inFlight.fetch_add(1) != 0) ++overlaps;
+          if (s.lastSeq[p] >= seq) ++reorders;
+          s.lastSeq[p] = seq;
+          if (seq % 97 == 0) std::this_thread::yield();
+          s.inFlight.fetch_sub(1);
+          ++ran;
+        });
+      }
+    });
+  }
+  for (auto& t : producers) t.join();
+  ASSERT_TRUE(pool.drain(30s));
+  EXPECT_EQ(ran.load(), kProducers * kPerProducer);
+  EXPECT_EQ(overlaps.load(), 0);
+  EXPECT_EQ(reorders.load(), 0);
+}
+
+TEST(SerialQueue, TenThousandQueuesShareAFewThreads) {
+  int before = threadsOfProcess();
+  ThreadPoolDispatcher pool(small(3));
+  std::mutex mu;  // guards ids
+  std::set<std::thread::id> ids;
+  std::atomic<int> maxThreads{0};
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  for (int i = 0; i < 10000; ++i) queues.push_back(pool.makeSerialQueue("many", QoS::Utility));
+  for (int round = 0; round < 3; ++round) {
+    for (auto& q : queues) {
+      q->async([&] {
+        {
+          std::lock_guard lock(mu);
+          ids.insert(std::this_thread::get_id());
+        }
+        int n = threadsOfProcess();
+        int seen = maxThreads.load();
+        while (n > seen && !maxThreads.compare_exchange_weak(seen, n)) {
+        }
+      });
+    }
+  }
+  ASSERT_TRUE(pool.drain(60s));
+  EXPECT_LE(ids.size(), 3u);
+  EXPECT_LE(maxThreads.load(), before + 3);
+  EXPECT_EQ(pool.workerCount(), 3u);
+}
+
+TEST(SerialQueue, ThrowingClosureDoesNotStopItsQueueOrThePool) {
+  ThreadPoolDispatcher pool(small(1));
+  auto q = pool.makeSerialQueue("throws", QoS::Default);
+  std::atomic<int> after{0};
+  q->async([] { throw std::runtime_error("boom"); });
+  q->async([] { throw 42; });
+  q->async([&] { ++after; });
+  pool.asyncLowPriority(0ns, [] { throw std::runtime_error("boom"); });
+  pool.asyncLowPriority(0ns, [&] { ++after; });
+  q->async(Task{});  // an empty closure is ignored
+  ASSERT_TRUE(pool.drain(10s));
+  EXPECT_EQ(after.load(), 2);
+}
+
+// Both core workers block; the other queues still complete thanks to stand-ins,
+// and the stand-ins leave once idle.
+TEST(BlockingRegion, BlockedQueuesDoNotStallOtherQueues) {
+  ThreadPoolDispatcher::Options o = small(2);
+  o.extraIdleTimeout = 50ms;
+  ThreadPoolDispatcher pool(o);
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  Countdown entered(2);
+  std::vector<std::shared_ptr<SerialQueue>> blockers;
+  for (int i = 0; i < 2; ++i) {
+    blockers.push_back(pool.makeSerialQueue("blocked", QoS::Utility));
+    blockers.back()->async([&, released] {
+      BlockingRegion outer;
+      BlockingRegion nested;  // counted once
+      entered.arrive();
+      released.wait_for(20s);
+    });
+  }
+  ASSERT_TRUE(entered.wait());
+
+  Countdown others(100);
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  for (int i = 0; i < 100; ++i) {
+    queues.push_back(pool.makeSerialQueue("free", QoS::Default));
+    queues.back()->async([&] { others.arrive(); });
+  }
+  EXPECT_TRUE(others.wait());
+  EXPECT_GE(pool.workerCount(), 3u);
+  EXPECT_FALSE(pool.drain(20ms));  // the blocked closures are still pending
+
+  release.set_value();
+  ASSERT_TRUE(pool.drain(10s));
+  auto deadline = std::chrono::steady_clock::now() + 10s;
+  while (pool.workerCount() > 2 && std::chrono::steady_clock::now() < deadline) std::this_thread::sleep_for(10ms);
+  EXPECT_EQ(pool.workerCount(), 2u);
+}
+
+TEST(BlockingRegion, StandInsAreCapped) {
+  ThreadPoolDispatcher::Options o = small(1);
+  o.maxExtraWorkers = 2;
+  ThreadPoolDispatcher pool(o);
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  Countdown entered(3);
+  std::atomic<int> done{0};
+  std::vector<std::shared_ptr<SerialQueue>> queues;
+  for (int i = 0; i < 6; ++i) {
+    queues.push_back(pool.makeSerialQueue("capped", QoS::Default));
+    queues.back()->async([&, released] {
+      BlockingRegion region;
+      entered.arrive();
+      released.wait_for(20s);
+      ++done;
+    });
+  }
+  ASSERT_TRUE(entered.wait());
+  std::this_thread::sleep_for(50ms);
+  EXPECT_EQ(pool.workerCount(), 3u);
+  EXPECT_EQ(done.load(), 0);
+  release.set_value();
+  ASSERT_TRUE(pool.drain(10s));
+  EXPECT_EQ(done.load(), 6);
+}
+
+TEST(BlockingRegion, DoesNothingOffThePool) {
+  BlockingRegion region;  // no observer on this thread: must not crash
+  SUCCEED();
+}
+
+TEST(LowPriority, DelayedTasksRunNoEarlierThanTheirDelay) {
+  ThreadPoolDispatcher pool(small(2));
+  auto start = std::chrono::steady_clock::now();
+  std::mutex mu;  // guards elapsed
+  std::vector<std::pair<std::chrono::milliseconds, std::chrono::steady_clock::duration>> elapsed;
+  Countdown done(3);
+  for (auto delay : {120ms, 40ms, 80ms}) {
+    pool.asyncLowPriority(delay, [&, delay] {
+      std::lock_guard lock(mu);
+      elapsed.emplace_back(delay, std::chrono::steady_clock::now() - start);
+      done.arrive();
+    });
+  }
+  ASSERT_TRUE(done.wait());
+  std::lock_guard lock(mu);
+  ASSERT_EQ(elapsed.size(), 3u);
+  for (auto& [delay, took] : elapsed) EXPECT_GE(took, delay);
+}
+
+TEST(LowPriority, TasksRunConcurrently) {
+  ThreadPoolDispatcher pool(small(2));
+  // Each task waits until both have started: only possible if they overlap.
+  Countdown started(2);
+  std::atomic<int> overlapped{0};
+  for (int i = 0; i < 2; ++i) {
+    pool.asyncLowPriority(i == 0 ? 0ns : std::chrono::nanoseconds(10ms), [&] {
+      started.arrive();
+      if (started.wait(10s)) ++overlapped;
+    });
+  }
+  ASSERT_TRUE(pool.drain(30s));
+  EXPECT_EQ(overlapped.load(), 2);
+}
+
+TEST(Drain, WaitsForCascadedWorkButNotForFutureDelays) {
+  ThreadPoolDispatcher pool(small(2));
+  auto a = pool.makeSerialQueue("a", QoS::Default);
+  auto b = pool.makeSerialQueue("b", QoS::Background);
+  std::atomic<int> ran{0};
+  std::atomic<bool> delayedRan{false};
+  pool.asyncLowPriority(std::chrono::hours(1), [&] { delayedRan = true; });
+  a->async([&] {
+    std::this_thread::sleep_for(20ms);
+    ++ran;
+    b->async([&] {
+      std::this_thread::sleep_for(20ms);
+      ++ran;
+    });
+  });
+  EXPECT_TRUE(pool.drain(10s));
+  EXPECT_EQ(ran.load(), 2);
+  pool.shutdown();
+  EXPECT_FALSE(delayedRan.load());
+}
+
+TEST(Shutdown, DropsLaterWorkAndOutlivingQueuesStaySafe) {
+  std::shared_ptr<SerialQueue> survivor;
+  std::atomic<int> ran{0};
+  {
+    ThreadPoolDispatcher pool(small(2));
+    survivor = pool.makeSerialQueue("survivor", QoS::Default);
+    survivor->async([&] { ++ran; });
+    ASSERT_TRUE(pool.drain(10s));
+    pool.shutdown();
+    pool.shutdown();  // idempotent
+    EXPECT_EQ(pool.workerCount(), 0u);
+    survivor->async([&] { ++ran; });
+    pool.asyncLowPriority(0ns, [&] { ++ran; });
+    EXPECT_TRUE(pool.drain(10ms));
+  }
+  survivor->async([&] { ++ran; });  // the dispatcher is gone: ignored
+  EXPECT_EQ(ran.load(), 1);
+}
+
+TEST(Shutdown, ClosureSubmittedFromAClosureDuringShutdownIsDropped) {
+  std::atomic<int> ran{0};
+  auto pool = std::make_unique<ThreadPoolDispatcher>(small(1));
+  auto q = pool->makeSerialQueue("self", QoS::Default);
+  // A closure keeping its own queue alive must not leak when dropped.
+  std::promise<void> go;
+  auto gate = go.get_future().share();
+  q->async([q, gate, &ran] {
+    gate.wait_for(10s);
+    ++ran;
+    q->async([&ran] { ++ran; });
+  });
+  for (int i = 0; i < 10; ++i) q->async([q, &ran] { ++ran; });
+  std::thread stopper([&] { pool->shutdown(); });
+  std::this_thread::sleep_for(20ms);
+  go.set_value();
+  stopper.join();
+  pool.reset();
+  EXPECT_GE(ran.load(), 1);
+  EXPECT_LE(ran.load(), 12);
+}
+
+}  // namespace
+}  // namespace vireo
