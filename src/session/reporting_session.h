@@ -90,7 +90,10 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
  private:
   VRReportingSession(std::shared_ptr<ReportingEnvironment> env, std::int64_t reporterID,
                      std::vector<std::int32_t> processIdentifiers);
-  void startBackendSession(const Dictionary& userInfo, const std::string& serviceName);
+  // The backend-session closure run on skylarkReportingQueue after start.
+  void startBackendSession(const Dictionary& userInfo, const std::string& serviceName, bool backendFound);
+  // Orientation tracking needs the orientation service, which this platform lacks.
+  bool shouldReportOrientation() const { return false; }
   void deliver(const Dictionary& cleaned, const Dictionary& received, bool submittedWhileStarted,
                std::uint32_t category, std::uint16_t type);
 
