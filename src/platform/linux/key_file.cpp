@@ -1,6 +1,7 @@
 #include "platform/linux/key_file.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
