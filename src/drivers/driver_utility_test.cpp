@@ -1,0 +1,390 @@
+#include "drivers/driver_utility.h"
+
+#include <stdlib.h>
+
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <thread>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "platform/linux/stats_tree.h"
+
+namespace vireo {
+namespace {
+
+namespace fs = std::filesystem;
+using ::testing::ElementsAre;
+
+struct LogLine {
+  LogScope scope;
+  LogLevel level;
+  std::string function;
+  std::string message;
+};
+
+class TestLogger final : public Logger {
+ public:
+  bool verbose(LogScope) const override { return true; }
+  void write(LogScope scope, LogLevel level, const char*, int, const char* function,
+             std::string_view message) override {
+    std::lock_guard lock(mutex_);
+    lines_.push_back({scope, level, function, std::string(message)});
+  }
+  std::vector<LogLine> lines() const {
+    std::lock_guard lock(mutex_);
+    return lines_;
+  }
+  std::vector<std::string> messages() const {
+    std::vector<std::string> out;
+    for (const auto& l : lines()) out.push_back(l.message);
+    return out;
+  }
+  void clear() {
+    std::lock_guard lock(mutex_);
+    lines_.clear();
+  }
+
+ private:
+  mutable std::mutex mutex_;  // guards lines_
+  std::vector<LogLine> lines_;
+};
+
+Dictionary dict(std::initializer_list<std::pair<const char*, std::int64_t>> entries) {
+  Dictionary d;
+  for (const auto& [k, v] : entries) d.set(Value(k), Value(v));
+  return d;
+}
+
+// ---- With the real statistics tree ----
+
+class TreeFixture : public ::testing::Test {
+ protected:
+  TreeFixture() {
+    std::string pattern = (fs::temp_directory_path() / "vireo-drivers-XXXXXX").string();
+    if (::mkdtemp(pattern.data()) == nullptr) std::abort();
+    root_ = pattern;
+    stats_ = root_ / "stats";
+  }
+  ~TreeFixture() override {
+    std::error_code ec;
+    fs::remove_all(root_, ec);
+  }
+  void write(const std::string& relative, const std::string& text) {
+    fs::create_directories((stats_ / relative).parent_path());
+    std::ofstream(stats_ / relative, std::ios::trunc) << text;
+  }
+  fs::path root_;
+  fs::path stats_;
+  TestLogger logger_;
+};
+
+TEST_F(TreeFixture, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
+  write("OrvaneTK4HB/rx", "10");
+  write("OrvaneTK4HB/dsp/overruns", "0");
+  write("Speaker/x", "5");
+  write("A/MCA/drops", "1");
+  write("B/MCA/drops", "3");
+  write("Haptics/Stats/on", "0");
+  write("Haptics/Other/ignored", "0");
+  linux_platform::StatsTreeLibrary library(stats_.string());
+  VRReportingDriverUtility utility(library, logger_);
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
+
+  auto snapshot = utility.getSnapShot();
+  std::vector<std::string> keys;
+  for (const auto& [key, set] : snapshot->samples) keys.push_back(key);
+  EXPECT_THAT(keys, ElementsAre("OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"));
+
+  // Nothing grew yet.
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
+
+  write("OrvaneTK4HB/rx", "15");
+  write("OrvaneTK4HB/dsp/overruns", "2");
+  write("Speaker/x", "3");        // went down: not reported
+  write("A/MCA/drops", "4");      // +3, then replaced by B's +7 under the same key
+  write("B/MCA/drops", "10");
+  write("Haptics/Stats/on", "2");
+  write("Haptics/Other/ignored", "9");
+  auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
+  ASSERT_TRUE(delta);
+  EXPECT_EQ(*delta, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"MCA_drops", 7},
+                          {"Haptics_Stats_on", 2}}));
+  EXPECT_EQ(delta->find("MCA_drops")->kind(), Value::Kind::Int);
+
+  // Without a snapshot: absolute values of at least 1.
+  auto absolute = utility.getDriverStatisticsRelativeToSnapShot(nullptr);
+  ASSERT_TRUE(absolute);
+  EXPECT_EQ(*absolute, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 15}, {"Speaker_x", 3},
+                             {"MCA_drops", 10}, {"Haptics_Stats_on", 2}}));
+
+  // A driver missing from the snapshot counts from zero.
+  DriverSnapshot partial;
+  partial.samples.push_back(snapshot->samples[0]);
+  auto fromZero = utility.getDriverStatisticsRelativeToSnapShot(&partial);
+  ASSERT_TRUE(fromZero);
+  EXPECT_EQ(*fromZero, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"Speaker_x", 3},
+                             {"MCA_drops", 10}, {"Haptics_Stats_on", 2}}));
+}
+
+TEST_F(TreeFixture, NoChannelsMeansNoSubscriptionsEmptySnapshotAndNoDelta) {
+  linux_platform::StatsTreeLibrary library(stats_.string());  // no tree at all
+  VRReportingDriverUtility utility(library, logger_);
+  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
+  EXPECT_THAT(logger_.messages(),
+              ElementsAre("creating hwreporting driver utility",
+                          "couldn't find any channels for driver group OrvaneTK4HB-(null)",
+                          "subscribed to group group OrvaneTK4HB-(null)",
+                          "couldn't find any channels for driver group Speaker-(null)",
+                          "subscribed to group group Speaker-(null)",
+                          "couldn't find any channels for driver group (null)-MCA",
+                          "subscribed to group group (null)-MCA",
+                          "couldn't find any channels for driver group Haptics-Stats",
+                          "subscribed to group group Haptics-Stats"));
+  for (const auto& line : logger_.lines()) {
+    EXPECT_EQ(line.scope, LogScope::Driver);
+    EXPECT_EQ(line.function, "-[VRReportingDriverUtility init]");
+  }
+  EXPECT_EQ(logger_.lines()[0].level, LogLevel::Info);
+  EXPECT_EQ(logger_.lines()[1].level, LogLevel::Info);
+  EXPECT_EQ(logger_.lines()[2].level, LogLevel::Default);
+
+  logger_.clear();
+  auto snapshot = utility.getSnapShot();
+  EXPECT_TRUE(snapshot->samples.empty());
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), std::nullopt);
+  EXPECT_TRUE(logger_.lines().empty());
+}
+
+TEST_F(TreeFixture, SafeFromSeveralThreadsAtOnce) {
+  write("Speaker/x", "1");
+  write("Haptics/Stats/y", "1");
+  linux_platform::StatsTreeLibrary library(stats_.string());
+  VRReportingDriverUtility utility(library, logger_);
+  std::vector<std::thread> threads;
+  std::mutex mutex;  // guards failures
+  int failures = 0;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&] {
+      for (int i = 0; i < 50; ++i) {
+        auto snapshot = utility.getSnapShot();
+        auto absolute = utility.getDriverStatisticsRelativeToSnapShot(nullptr);
+        if (snapshot->samples.size() != 2 || !absolute || absolute->size() != 2) {
+          std::lock_guard lock(mutex);
+          ++failures;
+        }
+      }
+    });
+  }
+  for (auto& t : threads) t.join();
+  EXPECT_EQ(failures, 0);
+}
+
+// ---- With a scripted library, for the failures the tree never produces ----
+
+struct FakeChannel : DriverChannel {
+  std::optional<std::string> name;
+  std::int64_t value = 0;
+};
+
+struct FakeSamples : DriverSampleSet {
+  std::vector<FakeChannel> channels;
+  std::unique_ptr<DriverSampleSet> copy() const override { return std::make_unique<FakeSamples>(*this); }
+};
+
+struct FakeSubscribed : DriverSubscribedChannels {
+  std::string driver;
+  std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<FakeSubscribed>(*this); }
+};
+
+struct FakeChannelSet : DriverChannelSet {
+  std::string driver;
+  std::int32_t count = 0;
+};
+
+// Keyed by the driver's description ("Speaker-(null)").
+struct DriverScript {
+  std::int32_t channels = 1;
+  std::optional<std::int64_t> copyError;
+  bool returnsSet = true;
+  bool subscriptionFails = false;
+  std::optional<std::int64_t> samplesError;
+  std::vector<FakeChannel> values;
+};
+
+class ScriptedLibrary final : public DriverStatsLibrary {
+ public:
+  std::map<std::string, DriverScript> drivers;
+  std::optional<std::int64_t> deltaError;
+  std::vector<std::string> deltaEarlier;  // "none" or the earlier set's first channel name
+
+  std::unique_ptr<DriverChannelSet> copyChannelsInGroup(const std::optional<std::string>& group,
+                                                        const std::optional<std::string>& subGroup, std::uint64_t,
+                                                        std::optional<DriverStatsError>* error) override {
+    const std::string key = group.value_or("(null)") + "-" + subGroup.value_or("(null)");
+    auto it = drivers.find(key);
+    if (it == drivers.end()) return nullptr;
+    if (it->second.copyError) *error = DriverStatsError{*it->second.copyError};
+    if (!it->second.returnsSet) return nullptr;
+    auto set = std::make_unique<FakeChannelSet>();
+    set->driver = key;
+    set->count = it->second.channels;
+    return set;
+  }
+  std::int32_t channelCount(const DriverChannelSet& channels) override {
+    return static_cast<const FakeChannelSet&>(channels).count;
+  }
+  DriverSubscriptionHandle createSubscription(const DriverChannelSet& channels,
+                                              std::unique_ptr<DriverSubscribedChannels>* subscribed) override {
+    const auto& set = static_cast<const FakeChannelSet&>(channels);
+    if (drivers[set.driver].subscriptionFails) return nullptr;
+    auto s = std::make_unique<FakeSubscribed>();
+    s->driver = set.driver;
+    *subscribed = std::move(s);
+    return this;
+  }
+  std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle handle,
+                                                 const DriverSubscribedChannels& subscribed,
+                                                 std::optional<DriverStatsError>* error) override {
+    const auto* s = dynamic_cast<const FakeSubscribed*>(&subscribed);
+    if (!handle || !s) {
+      *error = DriverStatsError{22};
+      return nullptr;
+    }
+    const DriverScript& script = drivers[s->driver];
+    if (script.samplesError) {
+      *error = DriverStatsError{*script.samplesError};
+      return std::make_unique<FakeSamples>();  // an error wins even when a set comes back
+    }
+    auto samples = std::make_unique<FakeSamples>();
+    samples->channels = script.values;
+    return samples;
+  }
+  std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet* earlier, const DriverSampleSet& later,
+                                                      std::optional<DriverStatsError>* error) override {
+    const auto& after = static_cast<const FakeSamples&>(later);
+    deltaEarlier.push_back(earlier ? "set" : "none");
+    if (deltaError) {
+      *error = DriverStatsError{*deltaError};
+      return nullptr;
+    }
+    auto delta = std::make_unique<FakeSamples>(after);
+    if (earlier) {
+      const auto& before = static_cast<const FakeSamples&>(*earlier);
+      for (std::size_t i = 0; i < delta->channels.size() && i < before.channels.size(); ++i)
+        delta->channels[i].value -= before.channels[i].value;
+    }
+    return delta;
+  }
+  void iterate(const DriverSampleSet& samples,
+               const std::function<DriverIterate(const DriverChannel&)>& visitor) override {
+    for (const auto& c : static_cast<const FakeSamples&>(samples).channels) {
+      if (visitor(c) == DriverIterate::Stop) break;
+    }
+  }
+  std::optional<std::string> channelName(const DriverChannel& channel) override {
+    return static_cast<const FakeChannel&>(channel).name;
+  }
+  std::int64_t simpleIntegerValue(const DriverChannel& channel) override {
+    return static_cast<const FakeChannel&>(channel).value;
+  }
+};
+
+FakeChannel channel(std::optional<std::string> name, std::int64_t value) {
+  FakeChannel c;
+  c.name = std::move(name);
+  c.value = value;
+  return c;
+}
+
+TEST(DriverUtilityFailures, CopyErrorIsLoggedAndAReturnedSetIsStillSubscribed) {
+  ScriptedLibrary library;
+  library.drivers["OrvaneTK4HB-(null)"].channels = 2;
+  library.drivers["OrvaneTK4HB-(null)"].copyError = 5;
+  library.drivers["Speaker-(null)"].copyError = 6;
+  library.drivers["Speaker-(null)"].returnsSet = false;
+  library.drivers["(null)-MCA"].channels = 0;
+  TestLogger logger;
+  VRReportingDriverUtility utility(library, logger);
+
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 1u);
+  EXPECT_EQ(utility.ioChannelSubscriptions()[0]->driver()->description(), "OrvaneTK4HB-(null)");
+  EXPECT_THAT(logger.messages(), ElementsAre("creating hwreporting driver utility",
+                                             "error 5 getting channels for driver OrvaneTK4HB-(null)",
+                                             "subscribed to group group OrvaneTK4HB-(null)",
+                                             "error 6 getting channels for driver Speaker-(null)",
+                                             "couldn't find any channels for driver group (null)-MCA",
+                                             "subscribed to group group (null)-MCA"));
+  EXPECT_EQ(logger.lines()[1].level, LogLevel::Error);
+}
+
+TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriver) {
+  ScriptedLibrary library;
+  library.drivers["Speaker-(null)"].values = {channel("x", 4)};
+  library.drivers["Haptics-Stats"].samplesError = 7;
+  library.drivers["Haptics-Stats"].values = {channel("y", 9)};
+  TestLogger logger;
+  VRReportingDriverUtility utility(library, logger);
+  logger.clear();
+
+  auto snapshot = utility.getSnapShot();
+  ASSERT_EQ(snapshot->samples.size(), 1u);
+  EXPECT_EQ(snapshot->samples[0].first, "Speaker-(null)");
+  EXPECT_THAT(logger.messages(), ElementsAre("sampling driver Speaker-(null)", "sampling driver Haptics-Stats",
+                                             "HWReportCreateSamples error 7"));
+  EXPECT_EQ(logger.lines()[2].level, LogLevel::Error);
+  EXPECT_EQ(logger.lines()[2].function, "-[VRReportingDriverUtility getSnapShot]");
+
+  logger.clear();
+  library.drivers["Speaker-(null)"].values = {channel("x", 6)};
+  auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
+  ASSERT_TRUE(delta);
+  EXPECT_EQ(*delta, dict({{"Speaker_x", 2}}));
+  EXPECT_THAT(logger.messages(), ElementsAre("getting latest samples", "done getting latest samples",
+                                             "getting latest samples", "done getting latest samples",
+                                             "HWReportCreateSamples error 7"));
+  for (const auto& line : logger.lines())
+    EXPECT_EQ(line.function, "-[VRReportingDriverUtility getDriverStatisticsRelativeToSnapShot:]");
+}
+
+TEST(DriverUtilityFailures, DeltaErrorFallsBackToAbsoluteValues) {
+  ScriptedLibrary library;
+  library.drivers["Speaker-(null)"].values = {channel("x", 4), channel(std::nullopt, 3), channel("z", 0)};
+  library.drivers["(null)-MCA"].values = {channel("m", 1)};
+  TestLogger logger;
+  VRReportingDriverUtility utility(library, logger);
+  auto snapshot = utility.getSnapShot();
+  snapshot->samples.pop_back();  // MCA lacks its entry: passed on as no earlier set
+  library.deltaError = 9;
+  logger.clear();
+
+  auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
+  ASSERT_TRUE(delta);
+  // A nameless channel leaves the key ending in "_".
+  EXPECT_EQ(*delta, dict({{"Speaker_x", 4}, {"Speaker_", 3}, {"MCA_m", 1}}));
+  EXPECT_THAT(library.deltaEarlier, ElementsAre("set", "none"));
+  EXPECT_EQ(logger.messages()[2], "HWReportCreateSamplesDelta error 9");
+  EXPECT_EQ(logger.lines()[2].level, LogLevel::Error);
+}
+
+TEST(DriverUtilityFailures, FailedSubscriptionShowsUpAsSamplingError) {
+  ScriptedLibrary library;
+  library.drivers["Speaker-(null)"].subscriptionFails = true;
+  library.drivers["Speaker-(null)"].values = {channel("x", 4)};
+  TestLogger logger;
+  VRReportingDriverUtility utility(library, logger);
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 1u);
+  EXPECT_EQ(utility.ioChannelSubscriptions()[0]->subscription, nullptr);
+  logger.clear();
+
+  EXPECT_TRUE(utility.getSnapShot()->samples.empty());
+  EXPECT_THAT(logger.messages(), ElementsAre("sampling driver Speaker-(null)", "HWReportCreateSamples error 22"));
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), std::nullopt);
+}
+
+}  // namespace
+}  // namespace vireo
