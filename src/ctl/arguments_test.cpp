@@ -1,0 +1,89 @@
+#include "ctl/arguments.h"
+
+#include <gtest/gtest.h>
+
+namespace vireo::ctl {
+namespace {
+
+std::optional<Operation> parse(std::vector<std::string> words, std::string* error = nullptr) {
+  return parseOperation(words, error);
+}
+
+TEST(Arguments, TypedValues) {
+  EXPECT_EQ(parseTypedValue("12"), Value(12));
+  EXPECT_EQ(parseTypedValue("-3"), Value(-3));
+  EXPECT_EQ(parseTypedValue("0x10"), Value(16));
+  EXPECT_EQ(parseTypedValue("18446744073709551615"), Value(18446744073709551615ull));
+  EXPECT_EQ(parseTypedValue("1.5"), Value(1.5));
+  EXPECT_EQ(parseTypedValue("true"), Value(true));
+  EXPECT_EQ(parseTypedValue("false"), Value(false));
+  EXPECT_EQ(parseTypedValue("s:12"), Value("12"));
+  EXPECT_EQ(parseTypedValue("speaker"), Value("speaker"));
+  EXPECT_EQ(parseTypedValue("inf"), Value("inf"));
+  EXPECT_EQ(parseTypedValue(""), Value(""));
+}
+
+TEST(Arguments, NumbersAcceptHexAndRejectOverflow) {
+  EXPECT_EQ(parseUInt("0x40000003", UINT32_MAX), 0x40000003u);
+  EXPECT_EQ(parseUInt("4294967296", UINT32_MAX), std::nullopt);
+  EXPECT_EQ(parseUInt("-1", UINT32_MAX), std::nullopt);
+  EXPECT_EQ(parseInt64("-9223372036854775808"), INT64_MIN);
+  EXPECT_EQ(parseInt64("9223372036854775808"), std::nullopt);
+  EXPECT_EQ(parseInt64("12abc"), std::nullopt);
+}
+
+TEST(Arguments, SendAddressingAndEntries) {
+  auto op = parse({"send", "--to", "1,-2", "0x40000003", "4", "buffer size=512", "route=s:7"});
+  ASSERT_TRUE(op);
+  EXPECT_EQ(op->addressing, Addressing::To);
+  EXPECT_EQ(op->to, (std::vector<std::int64_t>{1, -2}));
+  EXPECT_EQ(op->category, 0x40000003u);
+  EXPECT_EQ(op->type, 4);
+  EXPECT_EQ(*op->entries.find("buffer size"), Value(512));
+  EXPECT_EQ(*op->entries.find("route"), Value("7"));
+
+  op = parse({"send", "--to-none", "1", "2"});
+  ASSERT_TRUE(op);
+  EXPECT_EQ(op->addressing, Addressing::ToNone);
+  EXPECT_TRUE(op->to.empty());
+  op = parse({"send", "1", "2"});
+  ASSERT_TRUE(op);
+  EXPECT_EQ(op->addressing, Addressing::Broadcast);
+}
+
+TEST(Arguments, UsageErrorsAreReported) {
+  std::string error;
+  EXPECT_FALSE(parse({"send", "1", "70000"}, &error));
+  EXPECT_NE(error.find("type"), std::string::npos);
+  EXPECT_FALSE(parse({"create"}, &error));
+  EXPECT_FALSE(parse({"create", "1", "2"}, &error));
+  EXPECT_FALSE(parse({"configure", "1", "novalue"}, &error));
+  EXPECT_FALSE(parse({"start", "1", "--later"}, &error));
+  EXPECT_FALSE(parse({"frobnicate"}, &error));
+  EXPECT_FALSE(parse({"sleep", "-1"}, &error));
+  auto start = parse({"start", "5", "--no-wait"});
+  ASSERT_TRUE(start);
+  EXPECT_EQ(start->startMode, StartMode::NoWait);
+}
+
+TEST(Arguments, SequencesAndScriptLines) {
+  auto seq = splitSequence({"create", "1", "--", "start", "1", "--no-wait", "--", "--", "list"});
+  ASSERT_EQ(seq.size(), 3u);
+  EXPECT_EQ(seq[1], (std::vector<std::string>{"start", "1", "--no-wait"}));
+  auto words = splitLine("configure 1 'name=a b' \"x=#1\"  # comment", nullptr);
+  ASSERT_TRUE(words);
+  EXPECT_EQ(*words, (std::vector<std::string>{"configure", "1", "name=a b", "x=#1"}));
+  EXPECT_FALSE(splitLine("send 'open", nullptr));
+}
+
+TEST(Arguments, Times) {
+  EXPECT_EQ(parseTime("1700000000.5"), 1700000000.5);
+  EXPECT_EQ(parseTime("2023-11-14T22:13:20Z"), 1700000000.0);
+  EXPECT_EQ(parseTime("2023-11-14 22:13:20"), 1700000000.0);
+  EXPECT_EQ(parseTime("2023-11-15T00:13:20+02:00"), 1700000000.0);
+  EXPECT_EQ(parseTime("2023-11-14"), 1699920000.0);
+  EXPECT_EQ(parseTime("yesterday"), std::nullopt);
+}
+
+}  // namespace
+}  // namespace vireo::ctl

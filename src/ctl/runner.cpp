@@ -1,0 +1,186 @@
+#include "ctl/runner.h"
+
+#include <nlohmann/json.hpp>
+
+#include <chrono>
+#include <thread>
+
+namespace vireo::ctl {
+
+namespace {
+
+using nlohmann::json;
+
+json idsJson(const std::vector<std::int64_t>& ids) {
+  json a = json::array();
+  for (auto id : ids) a.push_back(id);
+  return a;
+}
+
+std::string idsText(const std::vector<std::int64_t>& ids) {
+  if (ids.empty()) return "(none)";
+  std::string s;
+  for (auto id : ids) s += (s.empty() ? "" : " ") + std::to_string(id);
+  return s;
+}
+
+std::string boolText(bool b) { return b ? "true" : "false"; }
+
+}  // namespace
+
+void Runner::print(const std::string& text, const std::string& jsonLine) {
+  std::fprintf(out_, "%s\n", json_ ? jsonLine.c_str() : text.c_str());
+  std::fflush(out_);
+}
+
+bool Runner::fail(const Operation& op, const client::Error& e) {
+  std::fprintf(err_, "vireoctl: %s: %s: %s\n", op.name.c_str(), e.name.c_str(), e.message.c_str());
+  if (json_) {
+    json err{{"name", e.name}, {"message", e.message}};
+    if (!e.domain.empty()) {
+      err["domain"] = e.domain;
+      err["code"] = e.code;
+    }
+    print("", json{{"op", op.name}, {"error", err}}.dump());
+  }
+  return false;
+}
+
+void Runner::reportArrivedStarts() {
+  client_.pump(std::chrono::milliseconds(0));
+  for (auto& [id, handles] : pending_) {
+    while (!handles.empty() && handles.front().ready()) {
+      auto r = handles.front().wait();
+      handles.pop_front();
+      if (r)
+        print("start " + std::to_string(id) + ": answered " + boolText(*r),
+              json{{"op", "start"}, {"reporterID", id}, {"answered", *r}}.dump());
+      else
+        std::fprintf(err_, "vireoctl: start %lld: %s: %s\n", static_cast<long long>(id), r.error().name.c_str(),
+                     r.error().message.c_str());
+    }
+  }
+}
+
+bool Runner::waitStart(const Operation& op) {
+  auto it = pending_.find(op.id);
+  if (it == pending_.end() || it->second.empty())
+    return fail(op, {"com.orvane.vireoctl.NoPendingStart", "no start of this reporter ID is waiting", {}, 0});
+  client::StartHandle handle = it->second.front();
+  std::optional<client::Result<bool>> r;
+  if (op.seconds > 0)
+    r = handle.waitFor(std::chrono::milliseconds(static_cast<long long>(op.seconds * 1000)));
+  else
+    r = handle.wait();
+  if (!r) return fail(op, {"org.freedesktop.DBus.Error.Timeout", "no answer within the timeout", {}, 0});
+  it->second.pop_front();
+  if (!*r) return fail(op, r->error());
+  print("start " + std::to_string(op.id) + ": answered " + boolText(**r),
+        json{{"op", "start"}, {"reporterID", op.id}, {"answered", **r}}.dump());
+  return true;
+}
+
+bool Runner::run(const Operation& op) {
+  const std::string idText = std::to_string(op.id);
+  auto boolResult = [&](const client::Result<bool>& r, const std::string& label) {
+    if (!r) return fail(op, r.error());
+    print(label + ": " + boolText(*r), json{{"op", op.name}, {"reporterID", op.id}, {"result", *r}}.dump());
+    return true;
+  };
+  bool ok = true;
+  switch (op.kind) {
+    case OpKind::Create:
+      ok = boolResult(client_.createReportingSession(op.id), "create " + idText);
+      break;
+    case OpKind::SetServiceType:
+      ok = boolResult(client_.setServiceType(op.serviceType, op.id),
+                      "set-service-type " + idText + " " + std::to_string(op.serviceType));
+      break;
+    case OpKind::ServiceType: {
+      auto r = client_.getServiceNameForReporterID(op.id);
+      if (!r) return fail(op, r.error());
+      print("service-type " + idText + ": " + std::to_string(*r),
+            json{{"op", op.name}, {"reporterID", op.id}, {"serviceType", *r}}.dump());
+      break;
+    }
+    case OpKind::Configure:
+      ok = boolResult(client_.setConfiguration(op.entries, op.id), "configure " + idText);
+      break;
+    case OpKind::Start:
+      if (op.startMode == StartMode::NoWait) {
+        auto r = client_.startReportingSessionForIDNoWait(op.id);
+        if (!r) return fail(op, r.error());
+        print("start " + idText + ": sent", json{{"op", "start"}, {"reporterID", op.id}, {"sent", true}}.dump());
+      } else {
+        pending_[op.id].push_back(client_.startReportingSessionForID(op.id));
+        if (op.startMode == StartMode::Wait) {
+          Operation wait = op;
+          wait.kind = OpKind::WaitStart;
+          wait.seconds = 0;
+          return waitStart(wait);
+        }
+        print("start " + idText + ": sent, answer pending",
+              json{{"op", "start"}, {"reporterID", op.id}, {"pending", true}}.dump());
+      }
+      break;
+    case OpKind::Send: {
+      std::optional<std::vector<std::int64_t>> ids;
+      if (op.addressing == Addressing::To) ids = op.to;
+      if (op.addressing == Addressing::ToNone) ids.emplace();
+      auto r = client_.sendMessage(op.entries, op.category, op.type, ids);
+      if (!r) return fail(op, r.error());
+      json j{{"op", "send"}, {"category", op.category}, {"type", op.type}, {"result", "ok"}};
+      j["to"] = ids ? idsJson(*ids) : json(nullptr);
+      print("send: ok", j.dump());
+      break;
+    }
+    case OpKind::Stop:
+      ok = boolResult(client_.stopReportingSessionForID(op.id), "stop " + idText);
+      break;
+    case OpKind::Destroy:
+      ok = boolResult(client_.destroyReportingSession(op.id), "destroy " + idText);
+      break;
+    case OpKind::Valid: {
+      auto r = client_.reporterIDValid(op.id);
+      if (!r) return fail(op, r.error());
+      print("valid " + idText + ": reporterID=" + std::to_string(r->reporterID) +
+                " serviceType=" + std::to_string(r->serviceType),
+            json{{"op", "valid"}, {"reporterID", r->reporterID}, {"serviceType", r->serviceType}}.dump());
+      break;
+    }
+    case OpKind::List: {
+      auto r = client_.getAllReporters();
+      if (!r) return fail(op, r.error());
+      print("list: " + idsText(*r), json{{"op", "list"}, {"reporterIDs", idsJson(*r)}}.dump());
+      break;
+    }
+    case OpKind::Kill: {
+      auto r = client_.killService();
+      if (!r) return fail(op, r.error());
+      print("kill: sent", json{{"op", "kill"}, {"sent", true}}.dump());
+      break;
+    }
+    case OpKind::Ping: {
+      auto r = client_.ping();
+      if (!r) return fail(op, r.error());
+      print("ping: ok", json{{"op", "ping"}, {"result", "ok"}}.dump());
+      break;
+    }
+    case OpKind::Sleep: {
+      // Keeps answering the connection while sleeping so start answers show up.
+      auto until = std::chrono::steady_clock::now() + std::chrono::duration<double>(op.seconds);
+      while (std::chrono::steady_clock::now() < until) {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(until - std::chrono::steady_clock::now());
+        client_.pump(std::min(left, std::chrono::milliseconds(100)));
+        reportArrivedStarts();
+      }
+      break;
+    }
+    case OpKind::WaitStart:
+      return waitStart(op);
+  }
+  reportArrivedStarts();
+  return ok;
+}
+
+}  // namespace vireo::ctl

@@ -1,0 +1,144 @@
+#include "ctl/store_query.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <unistd.h>
+
+#include <nlohmann/json.hpp>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "ctl/defaults_command.h"
+
+namespace vireo::ctl {
+namespace {
+
+class StoreQueryTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char tmpl[] = "/tmp/vireoctl-test-XXXXXX";
+    ASSERT_TRUE(mkdtemp(tmpl));
+    dir_ = tmpl;
+    db_ = dir_ + "/vireo.db";
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(db_.c_str(), &db), SQLITE_OK);
+    const char* sql = R"(
+      CREATE TABLE telemetry_sessions (id INTEGER PRIMARY KEY, session_info TEXT NOT NULL, user_info TEXT NOT NULL,
+        backends TEXT, created_at REAL NOT NULL, flushed_at REAL);
+      CREATE TABLE telemetry_messages (id INTEGER PRIMARY KEY, session INTEGER REFERENCES telemetry_sessions(id),
+        session_info TEXT, user_info TEXT, category INTEGER NOT NULL, type INTEGER NOT NULL, payload TEXT NOT NULL,
+        sent_at REAL NOT NULL);
+      CREATE TABLE analytics_events (id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT NULL, at REAL NOT NULL);
+      CREATE TABLE energy_events (id INTEGER PRIMARY KEY, client INTEGER NOT NULL, name TEXT NOT NULL,
+        payload TEXT NOT NULL, at REAL NOT NULL);
+      INSERT INTO telemetry_sessions VALUES (1, '{"client_type":"x"}', '{"client_name":"vireo","service_name":"media"}',
+        '["local"]', 100, NULL);
+      INSERT INTO telemetry_sessions VALUES (2, '{}', '{"client_name":"vireo","service_name":"telephony"}', NULL, 200, 210);
+      INSERT INTO telemetry_messages VALUES (1, 1, NULL, NULL, 3, 4, '{"a_b":1}', 101);
+      INSERT INTO telemetry_messages VALUES (2, 2, NULL, NULL, 9, 0, '{"k":2}', 201);
+      INSERT INTO telemetry_messages VALUES (3, NULL, '{}', '{"service_name":"standalone"}', 8, 4, '{"k":3}', 300);
+      INSERT INTO analytics_events VALUES (1, 'com.orvane.vireo.Session_Generic.Start', '{"x":1}', 150);
+      INSERT INTO analytics_events VALUES (2, 'com.orvane.vireo.vrreportingclientuptime', '{"seconds":2.5}', 250);
+      INSERT INTO energy_events VALUES (1, 7, 'Lumen_Haptics', '{"EngineOnDuration":3}', 160);
+    )";
+    ASSERT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(db);
+  }
+  void TearDown() override { std::filesystem::remove_all(dir_); }
+
+  // Runs a query and returns its standard output.
+  std::string run(const std::string& table, std::vector<std::string> args, int* status = nullptr) {
+    std::string error;
+    auto q = parseStoreQuery(table, args, &error);
+    EXPECT_TRUE(q) << error;
+    if (!q) return {};
+    q->db = db_;
+    std::FILE* out = std::tmpfile();
+    int rc = runStoreQuery(*q, out, stderr);
+    if (status) *status = rc;
+    std::rewind(out);
+    std::string text;
+    char buf[4096];
+    size_t n;
+    while ((n = std::fread(buf, 1, sizeof buf, out)) > 0) text.append(buf, n);
+    std::fclose(out);
+    return text;
+  }
+
+  std::string dir_, db_;
+};
+
+TEST_F(StoreQueryTest, JsonColumnsAreEmbeddedAsJson) {
+  auto rows = nlohmann::json::parse(run("sessions", {"--json"}));
+  ASSERT_EQ(rows.size(), 2u);
+  EXPECT_EQ(rows[0]["user_info"]["service_name"], "media");
+  EXPECT_EQ(rows[0]["backends"][0], "local");
+  EXPECT_TRUE(rows[1]["backends"].is_null());
+  EXPECT_EQ(rows[1]["flushed_at"], 210.0);
+}
+
+TEST_F(StoreQueryTest, FiltersCombine) {
+  auto rows = nlohmann::json::parse(run("messages", {"--json", "--name", "tele*"}));
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["category"], 9);
+  rows = nlohmann::json::parse(run("messages", {"--json", "--name", "standalone"}));
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_TRUE(rows[0]["session"].is_null());
+  rows = nlohmann::json::parse(run("messages", {"--json", "--session", "1"}));
+  ASSERT_EQ(rows.size(), 1u);
+  rows = nlohmann::json::parse(run("messages", {"--json", "--since", "150", "--until=250"}));
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["id"], 2);
+  rows = nlohmann::json::parse(run("analytics", {"--json", "--name", "*uptime"}));
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0]["payload"]["seconds"], 2.5);
+  rows = nlohmann::json::parse(run("energy", {"--json", "--session", "7"}));
+  ASSERT_EQ(rows.size(), 1u);
+}
+
+TEST_F(StoreQueryTest, LimitKeepsTheLastRowsInOrder) {
+  auto rows = nlohmann::json::parse(run("messages", {"--json", "--limit", "2"}));
+  ASSERT_EQ(rows.size(), 2u);
+  EXPECT_EQ(rows[0]["id"], 2);
+  EXPECT_EQ(rows[1]["id"], 3);
+}
+
+TEST_F(StoreQueryTest, TextOutputShowsIsoTimes) {
+  std::string text = run("analytics", {"--limit", "1"});
+  EXPECT_NE(text.find("at=1970-01-01T00:04:10.000Z"), std::string::npos) << text;
+  EXPECT_NE(text.find("payload={\"seconds\":2.5}"), std::string::npos) << text;
+}
+
+TEST_F(StoreQueryTest, UsageAndMissingStore) {
+  std::string error;
+  EXPECT_FALSE(parseStoreQuery("analytics", {"--session", "1"}, &error));
+  EXPECT_FALSE(parseStoreQuery("sessions", {"--since", "soon"}, &error));
+  EXPECT_FALSE(parseStoreQuery("sessions", {"--limit"}, &error));
+  auto q = parseStoreQuery("sessions", {}, &error);
+  ASSERT_TRUE(q);
+  q->db = dir_ + "/missing.db";
+  EXPECT_EQ(runStoreQuery(*q, stdout, stdout), 1);
+}
+
+TEST_F(StoreQueryTest, DefaultsEditTheSuiteFile) {
+  std::string suite = dir_ + "/conf/com.orvane.vireo.conf";
+  std::FILE* sink = std::tmpfile();
+  EXPECT_EQ(runDefaults(suite, {"write", "disable_reporting", "true"}, false, sink, sink), 0);
+  EXPECT_EQ(runDefaults(suite, {"write", "device_name", "living", "room"}, false, sink, sink), 0);
+  std::ifstream in(suite);
+  std::stringstream ss;
+  ss << in.rdbuf();
+  EXPECT_NE(ss.str().find("disable_reporting=true\n"), std::string::npos);
+  EXPECT_NE(ss.str().find("device_name=living room\n"), std::string::npos);
+  EXPECT_EQ(runDefaults(suite, {"read", "disable_reporting"}, false, sink, sink), 0);
+  EXPECT_EQ(runDefaults(suite, {"delete", "disable_reporting"}, false, sink, sink), 0);
+  EXPECT_EQ(runDefaults(suite, {"read", "disable_reporting"}, false, sink, sink), 1);
+  EXPECT_EQ(runDefaults(suite, {"write", "only"}, false, sink, sink), 2);
+  std::fclose(sink);
+}
+
+}  // namespace
+}  // namespace vireo::ctl
