@@ -46,7 +46,7 @@ class VRReportingServerInstance final : public VRReportingServiceProtocol,
   void destroyReportingSession(std::int64_t reporterID, BoolReply reply) override;
   void reporterIDValid(std::int64_t reporterID, DictionaryReply reply) override;
   void getAllReporters(ReporterListReply reply) override;
-  [[noreturn]] void killService(BoolReply reply) override;
+  void killService(BoolReply reply) override;
 
   // findReportingSessionForID:acrossAllClients:
   std::shared_ptr<VRReportingSession> findReportingSessionForID(std::int64_t reporterID, bool acrossAllClients) const;

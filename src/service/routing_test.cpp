@@ -1,0 +1,155 @@
+#include <gtest/gtest.h>
+
+#include "fakes/service_fakes.h"
+
+namespace vireo {
+namespace {
+
+using testing::FakeConnection;
+using testing::Replies;
+using testing::ServiceHarness;
+using testing::SinkCall;
+
+class RoutingTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    a = h.connect(100, "player");
+    b = h.connect(200, "phone");
+    // Client a owns 1 (started) and 2 (created only); client b owns 3 (started).
+    make(*a, 1, true);
+    make(*a, 2, false);
+    make(*b, 3, true);
+    h.pump();
+  }
+  void make(FakeConnection& c, std::int64_t id, bool run) {
+    c.client().createReportingSession(id, nullptr);
+    c.client().setServiceType(2, id, nullptr);
+    if (run) c.client().startReportingSessionForID(id, nullptr);
+  }
+
+  std::shared_ptr<VRReportingSession> session(std::int64_t id) {
+    auto found = a->instance()->findReportingSessionForID(id, false);
+    return found ? found : b->instance()->findReportingSessionForID(id, false);
+  }
+  long payloads(std::int64_t id) {
+    auto data = session(id)->aggregatedPayloadData();
+    if (!data) return -1;
+    std::lock_guard guard(data->lock);
+    return static_cast<long>(data->entries.size());
+  }
+  // Sends from client a and returns what the reply held.
+  std::vector<std::optional<Error>> send(std::optional<std::vector<std::int64_t>> ids,
+                                         Dictionary payload = Dictionary{{"volume", 3}}) {
+    Replies<std::optional<Error>> replies;
+    a->client().sendMessage(std::move(payload), 0x40000003, 1, std::move(ids), replies.callback());
+    h.pump();
+    return replies.values;
+  }
+  std::size_t routedEvents() {
+    std::size_t n = 0;
+    for (const auto& e : h.fake.analytics.events()) n += e.name == "com.orvane.vireo.Routing_Playback.Start";
+    return n;
+  }
+
+  ServiceHarness h;
+  std::unique_ptr<FakeConnection> a, b;
+};
+
+// Exactly one reply, without an error.
+::testing::AssertionResult answeredWithoutError(const std::vector<std::optional<Error>>& replies) {
+  if (replies.size() != 1) return ::testing::AssertionFailure() << replies.size() << " replies";
+  if (replies[0]) return ::testing::AssertionFailure() << "error " << replies[0]->code;
+  return ::testing::AssertionSuccess();
+}
+
+TEST_F(RoutingTest, AddressedReachesNamedSessionsWhetherStartedOrNot) {
+  EXPECT_TRUE(answeredWithoutError(send(std::vector<std::int64_t>{3, 2})));
+  EXPECT_EQ(payloads(3), 1);
+  EXPECT_EQ(payloads(1), 0) << "not addressed";
+  EXPECT_EQ(routedEvents(), 2u);
+  // The created-but-not-started session sends it on its own.
+  h.fake.dispatcher.runLowPriority();
+  ASSERT_EQ(h.fake.telemetry.oneShots().size(), 1u);
+  EXPECT_EQ(h.fake.tracer.count(trace::kServerSend), 1u);
+}
+
+TEST_F(RoutingTest, AddressedCallsTheSinksBeforeTheSession) {
+  h.journal.watch(session(3));
+  send(std::vector<std::int64_t>{3}, Dictionary{{"EngineOnTime", 4.0}});
+  auto calls = h.journal.calls();
+  ASSERT_EQ(calls.size(), 2u);
+  EXPECT_EQ(calls[0].sink, "analytics");
+  EXPECT_EQ(calls[1].sink, "energy");
+  EXPECT_EQ(calls[0].watchedPayloads, 0);
+  EXPECT_EQ(calls[1].watchedPayloads, 0);
+  EXPECT_EQ(payloads(3), 1);
+}
+
+TEST_F(RoutingTest, BroadcastReachesStartedSessionsOfEveryClientSessionFirst) {
+  h.journal.watch(session(1));
+  send(std::nullopt, Dictionary{{"EngineOnTime", 4.0}});
+  EXPECT_EQ(payloads(1), 1);
+  EXPECT_EQ(payloads(3), 1);
+  EXPECT_EQ(payloads(2), 0) << "created but never started";
+  auto calls = h.journal.calls();
+  ASSERT_EQ(calls.size(), 4u);
+  EXPECT_EQ(calls[0].sink, "analytics");
+  EXPECT_EQ(calls[1].sink, "energy");
+  EXPECT_EQ(calls[0].watchedPayloads, 1) << "the session had the message before the sinks";
+  EXPECT_TRUE(h.fake.logger.contains("sessions for client 100 : "));
+  EXPECT_TRUE(h.fake.logger.contains("sessions for client 200 : "));
+  EXPECT_TRUE(h.fake.logger.contains("active reporting sessions 2 : "));
+  h.fake.dispatcher.runLowPriority();
+  EXPECT_TRUE(h.fake.telemetry.oneShots().empty());
+}
+
+TEST_F(RoutingTest, BroadcastWithNothingRunningGoesOutStandalone) {
+  for (std::int64_t id : {1, 3}) (id == 1 ? a : b)->client().stopReportingSessionForID(id, nullptr);
+  h.pump();
+  h.fake.defaults.set("com.orvane.vireo", "device_name", "kitchen");
+  h.postDefaults();
+  EXPECT_TRUE(answeredWithoutError(send(std::nullopt)));
+  EXPECT_TRUE(h.fake.logger.contains("active reporting sessions 0 : []"));
+  EXPECT_TRUE(h.fake.logger.contains("no active reporting sessions found, sending as standalone"));
+  EXPECT_EQ(routedEvents(), 0u) << "the sinks are not called";
+  h.fake.dispatcher.runLowPriority();
+  auto oneShots = h.fake.telemetry.oneShots();
+  ASSERT_EQ(oneShots.size(), 1u);
+  EXPECT_EQ(*oneShots[0].userInfo.find("service_name"), Value("standalone"));
+  EXPECT_EQ(oneShots[0].category, 3);
+  EXPECT_EQ(oneShots[0].type, 1);
+}
+
+TEST_F(RoutingTest, EmptyZeroOrUnknownListsSendNothing) {
+  for (const auto& ids : {std::vector<std::int64_t>{}, std::vector<std::int64_t>{0, 0}, std::vector<std::int64_t>{0, 99}}) {
+    EXPECT_TRUE(answeredWithoutError(send(ids)));
+  }
+  h.fake.dispatcher.runLowPriority();
+  EXPECT_TRUE(h.fake.telemetry.oneShots().empty()) << "no standalone fallback for a list";
+  EXPECT_TRUE(h.fake.analytics.events().empty());
+  EXPECT_EQ(payloads(1), 0);
+  EXPECT_EQ(payloads(3), 0);
+  EXPECT_EQ(h.fake.logger.count("failed to find reporting session 99"), 1u);
+  EXPECT_FALSE(h.fake.logger.contains("failed to find reporting session 0"));
+}
+
+TEST_F(RoutingTest, DisabledReportingRefusesBeforeAnySessionOrSinkSeesTheMessage) {
+  h.fake.defaults.set("com.orvane.vireo", "disable_reporting", "yes");
+  h.postDefaults();
+  for (const auto& ids : {std::optional<std::vector<std::int64_t>>{}, std::optional{std::vector<std::int64_t>{1}}}) {
+    auto replies = send(ids, Dictionary{{"EngineOnTime", 1.0}});
+    ASSERT_EQ(replies.size(), 1u);
+    ASSERT_TRUE(replies[0].has_value());
+    EXPECT_EQ(replies[0]->domain, "com.orvane.audio.reporting");
+    EXPECT_EQ(replies[0]->code, 1);
+  }
+  h.fake.dispatcher.runLowPriority();
+  EXPECT_TRUE(h.journal.calls().empty());
+  EXPECT_TRUE(h.fake.telemetry.oneShots().empty());
+  EXPECT_EQ(payloads(1), 0);
+  EXPECT_FALSE(h.fake.logger.contains("active reporting sessions"));
+  EXPECT_EQ(h.fake.tracer.count(trace::kServerSend), 2u);
+}
+
+}  // namespace
+}  // namespace vireo
