@@ -11,7 +11,7 @@
 #include <cstring>
 #include <mutex>
 
-#include "client/value_marshal.h"
+#include "platform/dbus/value_codec.h"
 
 namespace vireo::client {
 
@@ -255,11 +255,12 @@ Result<bool> boolCall(Connection& c, const char* method, auto&& fill) {
 
 int appendMessageArgs(sd_bus_message* m, const Dictionary& payload, std::uint32_t category, std::uint16_t type,
                       const std::optional<std::vector<std::int64_t>>& ids) {
-  int r = marshal::appendDictionary(m, payload);
+  int r = dbus::appendStringDictionary(m, payload);
   if (r < 0) return r;
   if ((r = sd_bus_message_append(m, "uqb", category, type, ids.has_value() ? 1 : 0)) < 0) return r;
   static const std::vector<std::int64_t> none;
-  return marshal::appendInt64Array(m, ids ? *ids : none);
+  const auto& list = ids ? *ids : none;
+  return sd_bus_message_append_array(m, 'x', list.data(), list.size() * sizeof(std::int64_t));
 }
 
 }  // namespace
@@ -286,7 +287,7 @@ Result<std::uint16_t> Client::getServiceNameForReporterID(std::int64_t id) {
 
 Result<bool> Client::setConfiguration(const Dictionary& configuration, std::int64_t id) {
   return boolCall(*conn_, "SetConfiguration", [&](sd_bus_message* m) {
-    int r = marshal::appendDictionary(m, configuration);
+    int r = dbus::appendStringDictionary(m, configuration);
     return r < 0 ? r : sd_bus_message_append(m, "x", id);
   });
 }
@@ -390,9 +391,14 @@ Result<ReporterInfo> Client::reporterIDValid(std::int64_t id) {
   if (!reply) return reply.error();
   Message owned{*reply};
   Dictionary d;
-  std::string why;
-  int r = marshal::readDictionary(owned.m, d, &why);
-  if (r < 0) return Error{"org.freedesktop.DBus.Error.InvalidSignature", "unexpected answer: " + why, {}, 0};
+  sd_bus_error e = SD_BUS_ERROR_NULL;
+  int r = dbus::readDictionary(owned.m, &d, &e);
+  if (r < 0) {
+    Error err{"org.freedesktop.DBus.Error.InvalidSignature",
+              std::string("unexpected answer: ") + (e.message ? e.message : ""), {}, 0};
+    sd_bus_error_free(&e);
+    return err;
+  }
   ReporterInfo info;
   if (const Value* v = d.find("reporterID")) info.reporterID = v->toInt64().value_or(0);
   if (const Value* v = d.find("serviceType")) info.serviceType = static_cast<std::uint16_t>(v->toInt64().value_or(0));
