@@ -5,7 +5,7 @@
 #include <chrono>
 #include <thread>
 
-#include "fake_platform.h"
+#include "fakes/fake_platform.h"
 
 namespace vireo {
 namespace {
