@@ -1,0 +1,453 @@
+#include "platform/linux/store/store.h"
+
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstring>
+#include <utility>
+
+namespace vireo::linux_platform {
+
+namespace {
+
+// The contract's schema, word for word; IF NOT EXISTS lets every start run it.
+constexpr const char* kSchema = R"sql(
+CREATE TABLE IF NOT EXISTS telemetry_sessions (
+  id           INTEGER PRIMARY KEY,
+  session_info TEXT NOT NULL,   -- client_type, client_version, session_id, batch_event, hierarchy_token
+  user_info    TEXT NOT NULL,   -- client_name, service_name, then the session's own entries
+  backends     TEXT,            -- JSON array of backend names found, NULL when none were found
+  created_at   REAL NOT NULL,   -- Unix time, seconds
+  flushed_at   REAL
+);
+CREATE TABLE IF NOT EXISTS telemetry_messages (
+  id           INTEGER PRIMARY KEY,
+  session      INTEGER REFERENCES telemetry_sessions(id),  -- NULL for a one-shot message
+  session_info TEXT,            -- one-shot messages only
+  user_info    TEXT,            -- one-shot messages only
+  category     INTEGER NOT NULL,
+  type         INTEGER NOT NULL,
+  payload      TEXT NOT NULL,
+  sent_at      REAL NOT NULL
+);
+CREATE TABLE IF NOT EXISTS analytics_events (
+  id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT NULL, at REAL NOT NULL);
+CREATE TABLE IF NOT EXISTS energy_events (
+  id INTEGER PRIMARY KEY, client INTEGER NOT NULL, name TEXT NOT NULL,
+  payload TEXT NOT NULL, at REAL NOT NULL);
+)sql";
+
+enum Statement { kInsertSession, kSetBackends, kSetFlushed, kInsertMessage, kInsertAnalytics, kInsertEnergy, kCount };
+
+constexpr const char* kStatementSql[kCount] = {
+    "INSERT INTO telemetry_sessions (id, session_info, user_info, backends, created_at, flushed_at) "
+    "VALUES (?1, ?2, ?3, NULL, ?4, NULL)",
+    "UPDATE telemetry_sessions SET backends = ?2 WHERE id = ?1",
+    "UPDATE telemetry_sessions SET flushed_at = ?2 WHERE id = ?1",
+    "INSERT INTO telemetry_messages (session, session_info, user_info, category, type, payload, sent_at) "
+    "VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7)",
+    "INSERT INTO analytics_events (name, payload, at) VALUES (?1, ?2, ?3)",
+    "INSERT INTO energy_events (client, name, payload, at) VALUES (?1, ?2, ?3, ?4)",
+};
+
+// mkdir -p, each new directory with mode 0755.
+bool makeDirectories(const std::string& path, std::string* error) {
+  if (path.empty()) {
+    *error = "no state directory";
+    return false;
+  }
+  std::size_t pos = 0;
+  while (pos != std::string::npos) {
+    pos = path.find('/', pos + 1);
+    std::string part = path.substr(0, pos);
+    if (part.empty() || part == "/") continue;
+    if (::mkdir(part.c_str(), 0755) == 0) {
+      ::chmod(part.c_str(), 0755);  // not narrowed by the umask
+    } else if (errno != EEXIST) {
+      *error = part + ": " + std::strerror(errno);
+      return false;
+    }
+  }
+  struct stat st {};
+  if (::stat(path.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+    *error = path + ": not a directory";
+    return false;
+  }
+  return true;
+}
+
+int bindText(sqlite3_stmt* s, int index, const std::string& text) {
+  return sqlite3_bind_text(s, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+}
+
+}  // namespace
+
+// One handed-over row or update, its JSON already written by the producer.
+struct LocalStore::Row {
+  enum class Kind : std::uint8_t { Session, Backends, Flushed, Message, Analytics, Energy };
+  Kind kind = Kind::Message;
+  bool hasId = false;     // Message: belongs to a session; Backends: not NULL
+  std::int64_t id = 0;    // the session's row id
+  std::int64_t a = 0;     // category or client
+  std::int64_t b = 0;     // type
+  double at = 0;
+  bool hasInfo = false;   // Message: one-shot session and user info present
+  std::string t1, t2, t3; // JSON columns and names, per kind
+
+  std::size_t bytes() const { return sizeof(Row) + t1.capacity() + t2.capacity() + t3.capacity(); }
+};
+
+LocalStore::LocalStore(const std::string& stateDirectory, Logger& logger, Clock& clock, Options options)
+    : logger_(logger), clock_(clock), options_(options) {
+  if (!openDatabase(stateDirectory)) {
+    finalizeDatabase();
+    closed_ = true;
+    return;
+  }
+  usable_.store(true, std::memory_order_release);
+  writer_ = std::thread([this] { writerLoop(); });
+}
+
+std::shared_ptr<LocalStore> LocalStore::open(const ServiceDirectories& directories, Logger& logger, Clock& clock) {
+  return std::make_shared<LocalStore>(directories.state, logger, clock);
+}
+
+LocalStore::~LocalStore() { close(); }
+
+void LocalStore::logError(const char* function, const char* what) {
+  VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, function, "%s: %s (%s)", path_.c_str(), what,
+         db_ ? sqlite3_errmsg(db_) : "no database");
+}
+
+bool LocalStore::openDatabase(const std::string& stateDirectory) {
+  std::string error;
+  path_ = stateDirectory + "/" + kFileName;
+  if (!makeDirectories(stateDirectory, &error)) {
+    VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::open", "cannot create %s: %s",
+           stateDirectory.c_str(), error.c_str());
+    return false;
+  }
+  // The connection is used by one thread at a time (constructor, then writer).
+  int rc = sqlite3_open_v2(path_.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX,
+                           nullptr);
+  if (rc != SQLITE_OK) {
+    logError("LocalStore::open", "cannot open the store");
+    return false;
+  }
+  sqlite3_busy_timeout(db_, static_cast<int>(options_.busyTimeout.count()));
+  sqlite3_stmt* mode = nullptr;
+  if (sqlite3_prepare_v2(db_, "PRAGMA journal_mode=WAL", -1, &mode, nullptr) != SQLITE_OK ||
+      sqlite3_step(mode) != SQLITE_ROW) {
+    sqlite3_finalize(mode);
+    logError("LocalStore::open", "cannot read the store");
+    return false;
+  }
+  const char* journal = reinterpret_cast<const char*>(sqlite3_column_text(mode, 0));
+  if (!journal || std::strcmp(journal, "wal") != 0) {
+    VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::open", "%s: WAL mode refused, using %s",
+           path_.c_str(), journal ? journal : "?");
+  }
+  sqlite3_finalize(mode);
+  if (!exec("PRAGMA synchronous=FULL") || !exec("BEGIN IMMEDIATE")) {
+    logError("LocalStore::open", "cannot set up the store");
+    return false;
+  }
+  if (!exec(kSchema) || !exec("COMMIT")) {
+    logError("LocalStore::open", "cannot create the schema");
+    exec("ROLLBACK");
+    return false;
+  }
+  if (!prepareStatements()) {
+    logError("LocalStore::open", "cannot prepare statements");
+    return false;
+  }
+  sqlite3_stmt* maxId = nullptr;
+  if (sqlite3_prepare_v2(db_, "SELECT COALESCE(MAX(id), 0) FROM telemetry_sessions", -1, &maxId, nullptr) !=
+          SQLITE_OK ||
+      sqlite3_step(maxId) != SQLITE_ROW) {
+    sqlite3_finalize(maxId);
+    logError("LocalStore::open", "cannot read the session ids");
+    return false;
+  }
+  nextSessionId_.store(sqlite3_column_int64(maxId, 0) + 1);
+  sqlite3_finalize(maxId);
+  return true;
+}
+
+bool LocalStore::prepareStatements() {
+  for (int i = 0; i < kCount; ++i) {
+    if (sqlite3_prepare_v3(db_, kStatementSql[i], -1, SQLITE_PREPARE_PERSISTENT, &statements_[i], nullptr) !=
+        SQLITE_OK)
+      return false;
+  }
+  return true;
+}
+
+bool LocalStore::exec(const char* sql) { return sqlite3_exec(db_, sql, nullptr, nullptr, nullptr) == SQLITE_OK; }
+
+void LocalStore::finalizeDatabase() {
+  for (auto*& s : statements_) {
+    sqlite3_finalize(s);
+    s = nullptr;
+  }
+  if (db_) {
+    sqlite3_close(db_);
+    db_ = nullptr;
+  }
+}
+
+std::string LocalStore::jsonObject(const Dictionary& d) {
+  auto json = toJson(Value(d), JsonMode::Lenient);
+  return json ? std::move(*json) : std::string("{}");
+}
+
+bool LocalStore::enqueue(Row&& row) {
+  if (!usable()) return false;
+  const std::size_t bytes = row.bytes();
+  const std::size_t half = options_.maxPendingBytes / 2;
+  bool accepted = false;
+  bool wake = false;
+  bool logOverflow = false;
+  {
+    std::lock_guard lock(mutex_);
+    if (stopping_) return false;
+    if (queueBytes_ + bytes > options_.maxPendingBytes) {
+      logOverflow = !overflowLogged_;
+      overflowLogged_ = true;
+    } else {
+      // The writer sleeps until the first row, then gathers for an interval
+      // unless the queue grows past half its budget.
+      if (queue_.empty()) {
+        firstPending_ = std::chrono::steady_clock::now();
+        wake = true;
+      }
+      wake = wake || (queueBytes_ < half && queueBytes_ + bytes >= half);
+      queueBytes_ += bytes;
+      queue_.push_back(std::move(row));
+      ++enqueued_;
+      accepted = true;
+    }
+  }
+  if (logOverflow) {
+    VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::enqueue",
+           "%s: writer queue full, dropping rows", path_.c_str());
+  }
+  if (wake) wake_.notify_one();
+  return accepted;
+}
+
+std::optional<std::int64_t> LocalStore::insertTelemetrySession(const Dictionary& sessionInfo,
+                                                               const Dictionary& userInfo, double createdAt) {
+  if (!usable()) return std::nullopt;
+  Row row;
+  row.kind = Row::Kind::Session;
+  row.id = nextSessionId_.fetch_add(1);
+  row.t1 = jsonObject(sessionInfo);
+  row.t2 = jsonObject(userInfo);
+  row.at = createdAt;
+  const std::int64_t id = row.id;
+  if (!enqueue(std::move(row))) return std::nullopt;
+  return id;
+}
+
+bool LocalStore::setBackends(std::int64_t sessionId, const std::optional<std::vector<std::string>>& backends) {
+  Row row;
+  row.kind = Row::Kind::Backends;
+  row.id = sessionId;
+  if (backends) {
+    Array names;
+    names.reserve(backends->size());
+    for (const auto& name : *backends) names.emplace_back(name);
+    row.hasId = true;
+    row.t1 = toJson(Value(std::move(names)), JsonMode::Lenient).value_or("[]");
+  }
+  return enqueue(std::move(row));
+}
+
+bool LocalStore::setFlushed(std::int64_t sessionId, double flushedAt) {
+  Row row;
+  row.kind = Row::Kind::Flushed;
+  row.id = sessionId;
+  row.at = flushedAt;
+  return enqueue(std::move(row));
+}
+
+bool LocalStore::insertTelemetryMessage(std::optional<std::int64_t> session, const Dictionary* sessionInfo,
+                                        const Dictionary* userInfo, std::int64_t category, std::int64_t type,
+                                        const Dictionary& payload, double sentAt) {
+  if (!usable()) return false;
+  Row row;
+  row.kind = Row::Kind::Message;
+  row.hasId = session.has_value();
+  row.id = session.value_or(0);
+  if (!session) {
+    row.hasInfo = true;
+    row.t1 = sessionInfo ? jsonObject(*sessionInfo) : "{}";
+    row.t2 = userInfo ? jsonObject(*userInfo) : "{}";
+  }
+  row.a = category;
+  row.b = type;
+  row.t3 = jsonObject(payload);
+  row.at = sentAt;
+  return enqueue(std::move(row));
+}
+
+bool LocalStore::insertAnalyticsEvent(std::string_view name, const Dictionary& payload, double at) {
+  if (!usable()) return false;
+  Row row;
+  row.kind = Row::Kind::Analytics;
+  row.t1 = std::string(name);
+  row.t2 = jsonObject(payload);
+  row.at = at;
+  return enqueue(std::move(row));
+}
+
+bool LocalStore::insertEnergyEvent(std::int64_t client, std::string_view name, const Dictionary& payload,
+                                   double at) {
+  if (!usable()) return false;
+  Row row;
+  row.kind = Row::Kind::Energy;
+  row.a = client;
+  row.t1 = std::string(name);
+  row.t2 = jsonObject(payload);
+  row.at = at;
+  return enqueue(std::move(row));
+}
+
+bool LocalStore::flush(std::chrono::milliseconds timeout) {
+  if (!usable()) return false;
+  std::unique_lock lock(mutex_);
+  const std::uint64_t target = enqueued_;
+  if (processedRows_ >= target) return lastWriteOk_;
+  if (flushTarget_ < target) flushTarget_ = target;
+  wake_.notify_one();
+  if (!processed_.wait_for(lock, timeout, [&] { return processedRows_ >= target; })) return false;
+  return lastWriteOk_;
+}
+
+void LocalStore::close() {
+  {
+    std::lock_guard lock(mutex_);
+    if (closed_) return;
+    closed_ = true;
+    stopping_ = true;
+  }
+  wake_.notify_all();
+  if (writer_.joinable()) writer_.join();
+  usable_.store(false, std::memory_order_release);
+  finalizeDatabase();
+}
+
+void LocalStore::writerLoop() {
+  std::vector<Row> batch;
+  std::unique_lock lock(mutex_);
+  for (;;) {
+    wake_.wait(lock, [&] { return stopping_ || !queue_.empty(); });
+    if (queue_.empty()) break;  // stopping, all written
+    // Gather more rows until the interval is up, unless someone is waiting for them.
+    wake_.wait_until(lock, firstPending_ + options_.commitInterval, [&] {
+      return stopping_ || flushTarget_ > processedRows_ || queueBytes_ >= options_.maxPendingBytes / 2;
+    });
+    batch.swap(queue_);
+    queueBytes_ = 0;
+    const std::uint64_t end = enqueued_;
+    lock.unlock();
+
+    bool ok = writeBatch(batch);
+    if (!ok) {
+      logError("LocalStore::writerLoop", "write failed, retrying");
+      std::this_thread::sleep_for(options_.retryDelay);
+      ok = writeBatch(batch);
+      if (!ok) {
+        VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::writerLoop",
+               "%s: write failed again, dropping %zu rows (%s)", path_.c_str(), batch.size(), sqlite3_errmsg(db_));
+      }
+    }
+    batch.clear();
+
+    lock.lock();
+    processedRows_ = end;
+    lastWriteOk_ = ok;
+    overflowLogged_ = false;
+    processed_.notify_all();
+  }
+}
+
+bool LocalStore::writeBatch(const std::vector<Row>& batch) {
+  if (!exec("BEGIN IMMEDIATE")) return false;
+  for (const auto& row : batch) {
+    if (!writeRow(row)) {
+      exec("ROLLBACK");
+      return false;
+    }
+  }
+  if (!exec("COMMIT")) {
+    exec("ROLLBACK");
+    return false;
+  }
+  return true;
+}
+
+bool LocalStore::writeRow(const Row& row) {
+  sqlite3_stmt* s = nullptr;
+  switch (row.kind) {
+    case Row::Kind::Session:
+      s = statements_[kInsertSession];
+      sqlite3_bind_int64(s, 1, row.id);
+      bindText(s, 2, row.t1);
+      bindText(s, 3, row.t2);
+      sqlite3_bind_double(s, 4, row.at);
+      break;
+    case Row::Kind::Backends:
+      s = statements_[kSetBackends];
+      sqlite3_bind_int64(s, 1, row.id);
+      if (row.hasId) {
+        bindText(s, 2, row.t1);
+      } else {
+        sqlite3_bind_null(s, 2);
+      }
+      break;
+    case Row::Kind::Flushed:
+      s = statements_[kSetFlushed];
+      sqlite3_bind_int64(s, 1, row.id);
+      sqlite3_bind_double(s, 2, row.at);
+      break;
+    case Row::Kind::Message:
+      s = statements_[kInsertMessage];
+      if (row.hasId) {
+        sqlite3_bind_int64(s, 1, row.id);
+      } else {
+        sqlite3_bind_null(s, 1);
+      }
+      if (row.hasInfo) {
+        bindText(s, 2, row.t1);
+        bindText(s, 3, row.t2);
+      } else {
+        sqlite3_bind_null(s, 2);
+        sqlite3_bind_null(s, 3);
+      }
+      sqlite3_bind_int64(s, 4, row.a);
+      sqlite3_bind_int64(s, 5, row.b);
+      bindText(s, 6, row.t3);
+      sqlite3_bind_double(s, 7, row.at);
+      break;
+    case Row::Kind::Analytics:
+      s = statements_[kInsertAnalytics];
+      bindText(s, 1, row.t1);
+      bindText(s, 2, row.t2);
+      sqlite3_bind_double(s, 3, row.at);
+      break;
+    case Row::Kind::Energy:
+      s = statements_[kInsertEnergy];
+      sqlite3_bind_int64(s, 1, row.a);
+      bindText(s, 2, row.t1);
+      bindText(s, 3, row.t2);
+      sqlite3_bind_double(s, 4, row.at);
+      break;
+  }
+  const int rc = sqlite3_step(s);
+  sqlite3_reset(s);
+  return rc == SQLITE_DONE;
+}
+
+}  // namespace vireo::linux_platform
