@@ -300,12 +300,15 @@ TEST(Shutdown, ClosureSubmittedFromAClosureDuringShutdownIsDropped) {
   // A closure keeping its own queue alive must not leak when dropped.
   std::promise<void> go;
   auto gate = go.get_future().share();
-  q->async([q, gate, &ran] {
+  std::promise<void> running;
+  q->async([q, gate, &ran, &running] {
+    running.set_value();
     gate.wait_for(10s);
     ++ran;
     q->async([&ran] { ++ran; });
   });
   for (int i = 0; i < 10; ++i) q->async([q, &ran] { ++ran; });
+  ASSERT_EQ(running.get_future().wait_for(10s), std::future_status::ready);
   std::thread stopper([&] { pool->shutdown(); });
   std::this_thread::sleep_for(20ms);
   go.set_value();

@@ -384,8 +384,10 @@ void ThreadPoolDispatcher::Core::timerMain() {
       timerCv_.wait(lock);
       continue;
     }
-    if (delayed_.front().due > std::chrono::steady_clock::now()) {
-      timerCv_.wait_until(lock, delayed_.front().due);
+    // A copy: the heap may grow, and move its elements, while this thread waits.
+    SteadyTime due = delayed_.front().due;
+    if (due > std::chrono::steady_clock::now()) {
+      timerCv_.wait_until(lock, due);
       continue;
     }
     std::pop_heap(delayed_.begin(), delayed_.end(), laterThan);
