@@ -128,18 +128,6 @@ TEST(StatsTreeLibrary, AbsentTreeHasNoChannelsAndNoError) {
   EXPECT_FALSE(error);
 }
 
-TEST(StatsTreeLibrary, TreeThatIsAFileReportsAnErrorWithAnEmptySet) {
-  TempDir dir;
-  writeFile(dir.path() / "stats", "1");
-  StatsTreeLibrary library((dir.path() / "stats").string());
-  std::optional<DriverStatsError> error;
-  auto set = library.copyChannelsInGroup("Speaker", std::nullopt, 0, &error);
-  ASSERT_TRUE(set);
-  EXPECT_EQ(library.channelCount(*set), 0);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, ENOTDIR);
-}
-
 TEST(StatsTreeLibrary, ReadsFilesAgainButKeepsTheChannelSetOfTheStart) {
   TempDir dir;
   const fs::path stats = dir.path() / "stats";
