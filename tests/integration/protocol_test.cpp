@@ -1,0 +1,256 @@
+// The service protocol as a client sees it on the bus: replies, sessions shared
+// between clients, clients that die, input that must be refused.
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+
+#include "platform/dbus/value_codec.h"
+#include "service_fixture.h"
+
+namespace vireo::itest {
+namespace {
+
+using client::Client;
+
+bool contains(const std::vector<std::int64_t>& ids, std::int64_t id) {
+  return std::find(ids.begin(), ids.end(), id) != ids.end();
+}
+
+class ProtocolTest : public ServiceTest {};
+
+TEST_F(ProtocolTest, ReplyTableForKnownAndUnknownSessions) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  EXPECT_EQ(*c->createReportingSession(42), true);
+  EXPECT_EQ(*c->setServiceType(2, 42), true);
+  EXPECT_EQ(*c->getServiceNameForReporterID(42), 2);
+  EXPECT_EQ(*c->setConfiguration(Dictionary{{"HostApplicationDisplayID", Value("Player")}, {"n", Value(1)}}, 42),
+            true);
+  auto valid = c->reporterIDValid(42);
+  ASSERT_TRUE(valid);
+  EXPECT_EQ(valid->reporterID, 42);
+  EXPECT_EQ(valid->serviceType, 2);
+  EXPECT_TRUE(contains(*c->getAllReporters(), 42));
+
+  // Unknown IDs still answer true (or the default answers).
+  EXPECT_EQ(*c->setServiceType(3, 99), true);
+  EXPECT_EQ(*c->getServiceNameForReporterID(99), 65535);
+  EXPECT_EQ(*c->setConfiguration(Dictionary{{"k", Value(1)}}, 99), true);
+  EXPECT_EQ(*c->stopReportingSessionForID(99), true);
+  EXPECT_EQ(*c->destroyReportingSession(99), true);
+  valid = c->reporterIDValid(99);
+  EXPECT_EQ(valid->reporterID, 0);
+  EXPECT_EQ(valid->serviceType, 65535);
+
+  EXPECT_EQ(*c->destroyReportingSession(42), true);
+  EXPECT_FALSE(contains(*c->getAllReporters(), 42));
+  EXPECT_EQ(*c->getServiceNameForReporterID(42), 65535);
+}
+
+TEST_F(ProtocolTest, ReporterIDZero) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  ASSERT_EQ(*c->createReportingSession(5), true);
+  ASSERT_EQ(*c->setServiceType(3, 5), true);
+  // The service answers ID 0 twice; only the first answer reaches the client and the
+  // next call gets its own answer.
+  EXPECT_EQ(*c->getServiceNameForReporterID(0), 65535);
+  EXPECT_EQ(*c->getServiceNameForReporterID(5), 3);
+  EXPECT_EQ(*c->setServiceType(4, 0), true);
+  EXPECT_EQ(*c->stopReportingSessionForID(0), true);
+  EXPECT_EQ(*c->destroyReportingSession(0), true);
+  auto valid = c->reporterIDValid(0);
+  EXPECT_EQ(valid->reporterID, 0);
+  EXPECT_EQ(valid->serviceType, 65535);
+  // Start of ID 0 answers at once.
+  auto start = c->startReportingSessionForID(0);
+  auto answer = start.waitFor(5s);
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(**answer, true);
+  // Create takes ID 0 like any other.
+  EXPECT_EQ(*c->createReportingSession(0), true);
+  EXPECT_TRUE(contains(*c->getAllReporters(), 0));
+}
+
+TEST_F(ProtocolTest, StartAnswersOnlyWhenTheSessionStops) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  ASSERT_EQ(*c->createReportingSession(7), true);
+  auto first = c->startReportingSessionForID(7);
+  auto again = c->startReportingSessionForID(7);    // already started: never answered
+  auto unknown = c->startReportingSessionForID(8);  // no such session: never answered
+  ASSERT_TRUE(c->getAllReporters());
+  EXPECT_FALSE(first.waitFor(300ms));
+  EXPECT_EQ(*c->stopReportingSessionForID(7), true);
+  auto answer = first.waitFor(5s);
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(**answer, true);
+  EXPECT_FALSE(again.waitFor(200ms));
+  EXPECT_FALSE(unknown.waitFor(10ms));
+
+  // Started again, the session keeps the new answer until the next stop.
+  auto second = c->startReportingSessionForID(7);
+  ASSERT_TRUE(c->getAllReporters());
+  EXPECT_FALSE(second.waitFor(200ms));
+  EXPECT_EQ(*c->destroyReportingSession(7), true);  // destroy stops a started session
+  answer = second.waitFor(5s);
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(**answer, true);
+}
+
+TEST_F(ProtocolTest, TwoClientsShareLookups) {
+  auto a = connect();
+  auto b = connect();
+  ASSERT_TRUE(a && b);
+  ASSERT_EQ(*a->createReportingSession(10), true);
+  ASSERT_EQ(*a->setServiceType(3, 10), true);
+  ASSERT_EQ(*b->createReportingSession(20), true);
+
+  auto valid = b->reporterIDValid(10);
+  EXPECT_EQ(valid->reporterID, 10);
+  EXPECT_EQ(valid->serviceType, 3);
+  EXPECT_EQ(*b->getServiceNameForReporterID(10), 3);
+  auto all = *a->getAllReporters();
+  EXPECT_TRUE(contains(all, 10) && contains(all, 20));
+  EXPECT_EQ(*b->getAllReporters(), all);
+
+  // B starts A's session; B's stop does not reach it (own map only), A's does.
+  auto start = b->startReportingSessionForID(10);
+  EXPECT_EQ(*b->stopReportingSessionForID(10), true);
+  EXPECT_FALSE(start.waitFor(300ms));
+  // Setting the type from B changes nothing either.
+  EXPECT_EQ(*b->setServiceType(9, 10), true);
+  EXPECT_EQ(*a->getServiceNameForReporterID(10), 3);
+  EXPECT_EQ(*a->stopReportingSessionForID(10), true);
+  auto answer = start.waitFor(5s);
+  ASSERT_TRUE(answer);
+  EXPECT_EQ(**answer, true);
+}
+
+TEST_F(ProtocolTest, ClientKilledMidSessionIsRemoved) {
+  int sync[2];
+  ASSERT_EQ(pipe(sync), 0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    ::close(sync[0]);
+    auto c = Client::connectAddress(busAddress_);
+    if (!c) _exit(1);
+    (*c)->createReportingSession(77);
+    auto start = (*c)->startReportingSessionForID(77);
+    (*c)->getAllReporters();
+    if (::write(sync[1], "x", 1) != 1) _exit(1);
+    for (;;) pause();
+  }
+  ::close(sync[1]);
+  char x;
+  ASSERT_EQ(::read(sync[0], &x, 1), 1);
+  ::close(sync[0]);
+
+  auto c = connect();
+  ASSERT_TRUE(c);
+  EXPECT_TRUE(contains(*c->getAllReporters(), 77));
+  ::kill(child, SIGKILL);
+  int status = 0;
+  waitpid(child, &status, 0);
+
+  EXPECT_TRUE(waitForLog("removing " + std::to_string(child) + " from the server client list"));
+  EXPECT_TRUE(eventually([&] { return !contains(*c->getAllReporters(), 77); }));
+  EXPECT_EQ(*c->createReportingSession(78), true);
+  EXPECT_TRUE(contains(*c->getAllReporters(), 78));
+}
+
+// Raw calls for input the client library would not send.
+class RawBus {
+ public:
+  explicit RawBus(const std::string& address) {
+    sd_bus_new(&bus_);
+    sd_bus_set_address(bus_, address.c_str());
+    sd_bus_set_bus_client(bus_, 1);
+    sd_bus_negotiate_fds(bus_, 1);
+    ok_ = sd_bus_start(bus_) >= 0;
+  }
+  ~RawBus() { sd_bus_flush_close_unref(bus_); }
+  bool ok() const { return ok_; }
+  sd_bus_message* call(const char* method) {
+    sd_bus_message* m = nullptr;
+    sd_bus_message_new_method_call(bus_, &m, client::kServiceName, client::kObjectPath, client::kInterface, method);
+    return m;
+  }
+  // The D-Bus error name of the answer, empty on success.
+  std::string send(sd_bus_message* m) {
+    sd_bus_error e = SD_BUS_ERROR_NULL;
+    sd_bus_message* reply = nullptr;
+    int r = sd_bus_call(bus_, m, 10'000'000, &e, &reply);
+    std::string name = r < 0 ? (e.name ? e.name : "failed") : "";
+    message_ = e.message ? e.message : "";
+    sd_bus_error_free(&e);
+    sd_bus_message_unref(reply);
+    sd_bus_message_unref(m);
+    return name;
+  }
+  const std::string& lastMessage() const { return message_; }
+
+ private:
+  sd_bus* bus_ = nullptr;
+  bool ok_ = false;
+  std::string message_;
+};
+
+Dictionary nestedPayload(int containers) {
+  // The payload itself is the first container.
+  Value v("leaf");
+  for (int i = 1; i < containers; ++i) v = Value(Dictionary{{"n", v}});
+  return v.asDictionary() ? *v.asDictionary() : Dictionary{{"leaf", v}};
+}
+
+TEST_F(ProtocolTest, BadInputIsRefusedAndTheServiceGoesOn) {
+  RawBus raw(busAddress_);
+  ASSERT_TRUE(raw.ok());
+  constexpr const char* kInvalidArgs = "org.freedesktop.DBus.Error.InvalidArgs";
+
+  sd_bus_message* m = raw.call("CreateReportingSession");
+  sd_bus_message_append(m, "s", "not a number");
+  EXPECT_FALSE(raw.send(m).empty());
+
+  m = raw.call("NoSuchMethod");
+  EXPECT_EQ(raw.send(m), "org.freedesktop.DBus.Error.UnknownMethod");
+
+  // A file descriptor inside the payload.
+  m = raw.call("SendMessage");
+  sd_bus_message_open_container(m, 'a', "{sv}");
+  sd_bus_message_open_container(m, 'e', "sv");
+  sd_bus_message_append_basic(m, 's', "fd");
+  sd_bus_message_append(m, "v", "h", STDERR_FILENO);
+  sd_bus_message_close_container(m);
+  sd_bus_message_close_container(m);
+  sd_bus_message_append(m, "uqbax", 3u, 1, 0, 0);
+  EXPECT_EQ(raw.send(m), kInvalidArgs);
+
+  auto c = connect();
+  ASSERT_TRUE(c);
+  auto deep = c->sendMessage(nestedPayload(17), 3, 1, std::vector<std::int64_t>{});
+  ASSERT_FALSE(deep);
+  EXPECT_EQ(deep.error().name, kInvalidArgs);
+  EXPECT_FALSE(deep.error().message.empty());
+  EXPECT_TRUE(c->sendMessage(nestedPayload(16), 3, 1, std::vector<std::int64_t>{}));
+  EXPECT_EQ(*c->setConfiguration(nestedPayload(16), 1), true);
+  EXPECT_FALSE(c->setConfiguration(nestedPayload(17), 1));
+
+  EXPECT_EQ(*c->createReportingSession(1), true);
+  EXPECT_TRUE(contains(*c->getAllReporters(), 1));
+  EXPECT_TRUE(daemon_.running());
+}
+
+TEST_F(ProtocolTest, KillServiceEndsTheProcessWithStatusTwo) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  ASSERT_TRUE(c->killService());
+  EXPECT_EQ(daemon_.waitExit(10s), 2);
+  EXPECT_NE(log().find("DESTROYING SERVICE"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace vireo::itest

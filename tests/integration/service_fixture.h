@@ -1,0 +1,96 @@
+// Runs the real daemon on a private bus for the integration tests: a session
+// dbus-daemon of its own, service directories in a temporary directory, stderr
+// captured to a file so tests can look for log lines.
+#pragma once
+
+#include <gtest/gtest.h>
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "vireo/client.h"
+
+namespace vireo::itest {
+
+using namespace std::chrono_literals;
+
+// A temporary directory removed with everything in it.
+class TempDir {
+ public:
+  TempDir();
+  ~TempDir();
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+// A child process started with its own environment and stdout+stderr in a file.
+class ChildProcess {
+ public:
+  ChildProcess() = default;
+  ~ChildProcess();
+  bool start(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
+             const std::string& outputFile, int* stdoutPipe = nullptr);
+  pid_t pid() const { return pid_; }
+  bool running();
+  // Exit status (WEXITSTATUS, or 128+signal), nothing when it did not end in time.
+  std::optional<int> waitExit(std::chrono::milliseconds timeout);
+  void signal(int sig);
+  void stop();  // SIGTERM, then SIGKILL after a grace period
+
+ private:
+  pid_t pid_ = -1;
+  std::optional<int> status_;
+};
+
+class ServiceTest : public ::testing::Test {
+ protected:
+  void SetUp() override;
+  void TearDown() override;
+
+  // Files written before the daemon starts (relative to the configuration directory).
+  virtual std::map<std::string, std::string> configurationFiles() { return {}; }
+  virtual void prepareRuntimeDirectory(const std::string& /*runtime*/) {}
+  // Starts the daemon (SetUp does it; tests that change files first may restart).
+  void startDaemon();
+
+  std::unique_ptr<client::Client> connect();
+  void writeFile(const std::string& path, const std::string& text);
+
+  std::string log();
+  bool waitForLog(const std::string& text, std::chrono::milliseconds timeout = 5s);
+  // Polls fn until it is true or the timeout passes.
+  template <class Fn>
+  static bool eventually(Fn&& fn, std::chrono::milliseconds timeout = 5s) {
+    auto until = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+      if (fn()) return true;
+      if (std::chrono::steady_clock::now() > until) return false;
+      std::this_thread::sleep_for(20ms);
+    }
+  }
+
+  // Store access, read-only.
+  std::int64_t count(const std::string& sql);
+  std::vector<nlohmann::json> rows(const std::string& sql);
+
+  std::unique_ptr<TempDir> dir_;
+  std::string busAddress_;
+  std::string configDir_, stateDir_, logsDir_, runtimeDir_;
+  std::map<std::string, std::string> extraEnv_;
+  ChildProcess bus_;
+  ChildProcess daemon_;
+  std::string daemonLog_;
+};
+
+}  // namespace vireo::itest

@@ -1,0 +1,205 @@
+// Messages and events as they reach the local store, the reporting switch, and the
+// files the service leaves behind.
+#include <signal.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "service_fixture.h"
+
+namespace vireo::itest {
+namespace {
+
+namespace fs = std::filesystem;
+
+class StoreTest : public ServiceTest {
+ protected:
+  // Starts a session of the given type and returns the pending start answer.
+  client::StartHandle startSession(client::Client& c, std::int64_t id, std::uint16_t type) {
+    EXPECT_EQ(*c.createReportingSession(id), true);
+    EXPECT_EQ(*c.setServiceType(type, id), true);
+    return c.startReportingSessionForID(id);
+  }
+  std::vector<nlohmann::json> messages(const std::string& where) {
+    return rows("SELECT * FROM telemetry_messages WHERE " + where + " ORDER BY id");
+  }
+};
+
+TEST_F(StoreTest, MessagesAreStoredWithCleanedKeysAndShortCategory) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  auto start = startSession(*c, 5, 2);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"buffer size", Value(512)}, {"a  b", Value("x")}, {"ratio", Value(0.5)}},
+                             0x40000003, 1, std::vector<std::int64_t>{5}));
+  std::vector<nlohmann::json> found;
+  ASSERT_TRUE(eventually([&] { return !(found = messages("type = 1")).empty(); }, 15s));
+  EXPECT_EQ(found[0]["category"], 3);
+  EXPECT_EQ(found[0]["payload"]["buffer_size"], 512);
+  EXPECT_EQ(found[0]["payload"]["a__b"], "x");
+  EXPECT_EQ(found[0]["payload"]["ratio"], 0.5);
+  EXPECT_FALSE(found[0]["session"].is_null());
+
+  auto sessions = rows("SELECT * FROM telemetry_sessions WHERE id = " + found[0]["session"].dump());
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(sessions[0]["user_info"]["service_name"], "telephony_session");
+  EXPECT_TRUE(eventually([&] {
+    return count("SELECT COUNT(*) FROM analytics_events WHERE name = 'com.orvane.vireo.Routing_Playback.Start'") == 1;
+  }));
+}
+
+TEST_F(StoreTest, BroadcastWithoutStartedSessionsGoesOutAsOneShotMessage) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(1)}}, 0x10000008, 4));
+  std::vector<nlohmann::json> found;
+  ASSERT_TRUE(eventually([&] { return !(found = messages("category = 8")).empty(); }, 10s));
+  EXPECT_TRUE(found[0]["session"].is_null());
+  EXPECT_EQ(found[0]["user_info"]["service_name"], "standalone");
+  // An empty ID list reaches nobody.
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(2)}}, 0x10000009, 4, std::vector<std::int64_t>{}));
+  ASSERT_TRUE(c->getAllReporters());
+  std::this_thread::sleep_for(1500ms);
+  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE category = 9"), 0);
+}
+
+TEST_F(StoreTest, DisableReportingFollowsTheNotification) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  writeFile(configDir_ + "/com.orvane.vireo.conf", "disable_reporting = true\n");
+  ASSERT_TRUE(c->postNotification(client::kReportingNotification));
+  client::Status last = client::Done{};
+  EXPECT_TRUE(eventually([&] { return !(last = c->sendMessage(Dictionary{{"k", Value(1)}}, 3, 1)).ok(); }));
+  ASSERT_FALSE(last);
+  EXPECT_EQ(last.error().name, client::kReportingDisabledError);
+  EXPECT_TRUE(last.error().isReportingDisabled());
+  EXPECT_EQ(last.error().domain, "com.orvane.audio.reporting");
+  EXPECT_EQ(last.error().code, 1);
+
+  writeFile(configDir_ + "/com.orvane.vireo.conf", "# reporting back on\n");
+  ASSERT_TRUE(c->postNotification(client::kReportingNotification));
+  EXPECT_TRUE(eventually([&] { return c->sendMessage(Dictionary{{"k", Value(1)}}, 3, 1).ok(); }));
+}
+
+TEST_F(StoreTest, SighupCountsAsTheNotification) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  writeFile(configDir_ + "/com.orvane.vireo.conf", "disable_reporting=yes\n");
+  daemon_.signal(SIGHUP);
+  EXPECT_TRUE(eventually([&] { return !c->sendMessage(Dictionary{}, 3, 1).ok(); }));
+}
+
+TEST_F(StoreTest, SigtermExitsCleanlyWithRowsCommitted) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  auto start = startSession(*c, 6, 0);
+  for (int i = 0; i < 20; ++i)
+    ASSERT_TRUE(c->sendMessage(Dictionary{{"i", Value(i)}}, 0x08000005, 3, std::vector<std::int64_t>{6}));
+  ASSERT_TRUE(c->getAllReporters());
+  daemon_.signal(SIGTERM);
+  EXPECT_EQ(daemon_.waitExit(15s), 0);
+  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE category = 5 AND type = 3"), 20);
+}
+
+TEST_F(StoreTest, SummaryMessageAtEveryStop) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  auto start = startSession(*c, 8, 7);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"a", Value(1)}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"a", Value(2)}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
+  ASSERT_EQ(*c->stopReportingSessionForID(8), true);
+  ASSERT_TRUE(start.waitFor(5s));
+  std::vector<nlohmann::json> found;
+  ASSERT_TRUE(eventually([&] { return !(found = messages("category = 65535 AND type = 65535")).empty(); }, 15s));
+  EXPECT_EQ(found[0]["payload"]["VR_Session_Summary_Event"], "7");
+  EXPECT_EQ(found[0]["payload"]["a"], "1,2");
+
+  // Restarted, the session sends its second summary (Undefined_Unknown_2).
+  auto again = c->startReportingSessionForID(8);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"b", Value("x")}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
+  ASSERT_EQ(*c->stopReportingSessionForID(8), true);
+  EXPECT_TRUE(eventually([&] { return messages("category = 65535 AND type = 65535").size() == 2; }, 15s));
+}
+
+TEST_F(StoreTest, ClientUptimeEventAfterTheClientLeaves) {
+  {
+    auto c = connect();
+    ASSERT_TRUE(c);
+    ASSERT_EQ(*c->createReportingSession(3), true);
+    std::this_thread::sleep_for(200ms);
+  }
+  std::vector<nlohmann::json> found;
+  ASSERT_TRUE(eventually(
+      [&] {
+        return !(found = rows("SELECT * FROM analytics_events WHERE name = 'com.orvane.vireo.vrreportingclientuptime'"))
+                    .empty();
+      },
+      10s));
+  EXPECT_TRUE(found[0]["payload"]["processName"].is_string());
+  EXPECT_GE(found[0]["payload"]["seconds"].get<double>(), 0.1);
+}
+
+class DriverStatisticsTest : public StoreTest {
+ protected:
+  void prepareRuntimeDirectory(const std::string& runtime) override {
+    writeFile(runtime + "/stats/Speaker/Underruns", "5\n");
+    writeFile(runtime + "/stats/Speaker/Overloads", "3\n");
+  }
+};
+
+TEST_F(DriverStatisticsTest, StopSendsThePositiveDeltaAsCategoryNine) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  auto start = startSession(*c, 9, 0);
+  ASSERT_TRUE(c->getAllReporters());
+  writeFile(runtimeDir_ + "/stats/Speaker/Underruns", "12\n");
+  ASSERT_EQ(*c->stopReportingSessionForID(9), true);
+  std::vector<nlohmann::json> found;
+  ASSERT_TRUE(eventually([&] { return !(found = messages("category = 9 AND type = 0")).empty(); }, 15s));
+  EXPECT_EQ(found[0]["payload"]["Speaker_Underruns"], 7);
+  EXPECT_FALSE(found[0]["payload"].contains("Speaker_Overloads"));
+}
+
+class InternalBuildTest : public StoreTest {
+ protected:
+  std::map<std::string, std::string> configurationFiles() override { return {{"device.conf", "InternalBuild=true\n"}}; }
+};
+
+TEST_F(InternalBuildTest, StopWritesTheSessionJsonFile) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  ASSERT_EQ(*c->createReportingSession(11), true);
+  ASSERT_EQ(*c->setServiceType(2, 11), true);
+  ASSERT_EQ(*c->setConfiguration(Dictionary{{"HostApplicationDisplayID", Value("Player")}}, 11), true);
+  auto start = c->startReportingSessionForID(11);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"route", Value("speaker")}}, 0x40000003, 1, std::vector<std::int64_t>{11}));
+  ASSERT_EQ(*c->stopReportingSessionForID(11), true);
+  ASSERT_TRUE(start.waitFor(5s));
+
+  fs::path dir = fs::path(logsDir_) / "Audio" / "Reporting";
+  fs::path file;
+  ASSERT_TRUE(eventually([&] {
+    std::error_code ec;
+    for (const auto& e : fs::directory_iterator(dir, ec))
+      if (e.path().filename().string().find("-vireo-Player-telephony.json") != std::string::npos) file = e.path();
+    return !file.empty();
+  }));
+  std::ifstream in(file);
+  auto content = nlohmann::json::parse(in, nullptr, false);
+  ASSERT_TRUE(content.is_array()) << file;
+  ASSERT_GE(content.size(), 2u);
+  EXPECT_EQ(content[0]["HostApplicationDisplayID"], "Player");
+  EXPECT_EQ(content[1]["Routing_Playback_Start_1"]["route"], "speaker");
+}
+
+TEST_F(StoreTest, NoJsonFileOnOtherBuilds) {
+  auto c = connect();
+  ASSERT_TRUE(c);
+  auto start = startSession(*c, 12, 2);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(1)}}, 3, 1, std::vector<std::int64_t>{12}));
+  ASSERT_EQ(*c->stopReportingSessionForID(12), true);
+  ASSERT_TRUE(start.waitFor(5s));
+  EXPECT_FALSE(fs::exists(fs::path(logsDir_) / "Audio" / "Reporting"));
+}
+
+}  // namespace
+}  // namespace vireo::itest
