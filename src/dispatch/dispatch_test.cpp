@@ -54,17 +54,6 @@ ThreadPoolDispatcher::Options small(std::size_t workers) {
   return o;
 }
 
-TEST(SerialQueue, RunsClosuresInSubmissionOrder) {
-  ThreadPoolDispatcher pool(small(4));
-  auto q = pool.makeSerialQueue("order", QoS::Default);
-  EXPECT_EQ(q->label(), "order");
-  std::vector<int> seen;  // touched only by the queue's closures
-  for (int i = 0; i < 5000; ++i) q->async([&seen, i] { seen.push_back(i); });
-  ASSERT_TRUE(pool.drain(10s));
-  ASSERT_EQ(seen.size(), 5000u);
-  for (int i = 0; i < 5000; ++i) ASSERT_EQ(seen[i], i);
-}
-
 // Many producers feed many queues; every closure checks that it is alone on its
 // queue and that each producer's sequence numbers arrive in order.
 TEST(SerialQueue, NeverRunsTwoClosuresOfOneQueueAtOnceUnderStress) {
@@ -117,11 +106,12 @@ TEST(SerialQueue, TenThousandQueuesShareAFewThreads) {
   for (int i = 0; i < 10000; ++i) queues.push_back(pool.makeSerialQueue("many", QoS::Utility));
   for (int round = 0; round < 3; ++round) {
     for (auto& q : queues) {
-      q->async([&] {
+      q->async([&, sample = (&q - queues.data()) % 100 == 0] {
         {
           std::lock_guard lock(mu);
           ids.insert(std::this_thread::get_id());
         }
+        if (!sample) return;
         int n = threadsOfProcess();
         int seen = maxThreads.load();
         while (n > seen && !maxThreads.compare_exchange_weak(seen, n)) {
@@ -212,11 +202,6 @@ TEST(BlockingRegion, StandInsAreCapped) {
   release.set_value();
   ASSERT_TRUE(pool.drain(10s));
   EXPECT_EQ(done.load(), 6);
-}
-
-TEST(BlockingRegion, DoesNothingOffThePool) {
-  BlockingRegion region;  // no observer on this thread: must not crash
-  SUCCEED();
 }
 
 TEST(LowPriority, DelayedTasksRunNoEarlierThanTheirDelay) {

@@ -36,7 +36,8 @@ class ThreadPoolDispatcher : public Dispatcher {
   // Delayed closures whose time has not come are not waited for. True when idle.
   bool drain(std::chrono::milliseconds budget);
   // Stops the workers and the timer and joins them; closures not yet started are
-  // dropped and later submissions are ignored. Idempotent.
+  // dropped and later submissions are ignored. Idempotent. Called from one of the
+  // pool's own closures it only stops the workers; the owner's call joins them.
   void shutdown();
 
   // Worker threads alive right now (for tests and diagnostics).

@@ -15,6 +15,7 @@ constexpr std::string_view kReplacement = "\xEF\xBF\xBD";
 std::size_t sequenceLength(std::string_view text, std::size_t i) {
   auto byte = [&](std::size_t k) { return static_cast<unsigned char>(text[k]); };
   unsigned char lead = byte(i);
+  if (lead == 0) return 0;  // a bus string cannot hold NUL
   if (lead < 0x80) return 1;
   std::size_t length;
   unsigned char low = 0x80, high = 0xBF;  // the allowed range of the second byte

@@ -23,8 +23,8 @@ class ProcfsProcessTable : public ProcessTable {
   const std::string procRoot_;
 };
 
-// text with every byte that is not part of a well-formed UTF-8 sequence replaced by
-// U+FFFD, so the name can travel as a bus string.
+// text with NUL and every byte that is not part of a well-formed UTF-8 sequence
+// replaced by U+FFFD, so the name can travel as a bus string.
 std::string validUtf8(std::string_view text);
 
 }  // namespace vireo::linux_platform
