@@ -1,0 +1,143 @@
+// Shared pieces of the load tools: bus connections, option parsing, the daemon's
+// process id and CPU time, and a barrier to start client threads together.
+#pragma once
+
+#include <systemd/sd-bus.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <sstream>
+#include <string>
+
+namespace vireo::bench {
+
+inline constexpr const char* kService = "com.orvane.vireo.Reporting1";
+inline constexpr const char* kPath = "/com/orvane/vireo/Reporting1";
+inline constexpr const char* kInterface = "com.orvane.vireo.Reporting1";
+
+// --name value or --name=value options; bare words are rejected.
+class Options {
+ public:
+  Options(int argc, char** argv, const char* usage) {
+    for (int i = 1; i < argc; ++i) {
+      std::string a = argv[i];
+      if (a == "-h" || a == "--help") {
+        std::fputs(usage, stdout);
+        std::exit(0);
+      }
+      if (a.rfind("--", 0) != 0) fail(usage, "unexpected argument " + a);
+      auto eq = a.find('=');
+      if (eq != std::string::npos) {
+        values_[a.substr(2, eq - 2)] = a.substr(eq + 1);
+      } else if (i + 1 < argc) {
+        values_[a.substr(2)] = argv[++i];
+      } else {
+        fail(usage, "missing value for " + a);
+      }
+    }
+  }
+  std::string text(const std::string& name, const std::string& fallback) const {
+    auto it = values_.find(name);
+    return it == values_.end() ? fallback : it->second;
+  }
+  long long number(const std::string& name, long long fallback) const {
+    auto it = values_.find(name);
+    return it == values_.end() ? fallback : std::atoll(it->second.c_str());
+  }
+
+ private:
+  [[noreturn]] static void fail(const char* usage, const std::string& why) {
+    std::fprintf(stderr, "%s\n%s", why.c_str(), usage);
+    std::exit(2);
+  }
+  std::map<std::string, std::string> values_;
+};
+
+// A new bus connection: the given address, else VIREO_BUS / the default bus rules.
+inline sd_bus* openBus(const std::string& address) {
+  sd_bus* bus = nullptr;
+  int r;
+  if (!address.empty()) {
+    r = sd_bus_new(&bus);
+    if (r >= 0) r = sd_bus_set_address(bus, address.c_str());
+    if (r >= 0) r = sd_bus_set_bus_client(bus, 1);
+    if (r >= 0) r = sd_bus_start(bus);
+  } else {
+    const char* env = std::getenv("VIREO_BUS");
+    bool system = env ? std::strcmp(env, "system") == 0 : geteuid() == 0;
+    r = system ? sd_bus_open_system(&bus) : sd_bus_open_user(&bus);
+  }
+  if (r < 0) {
+    std::fprintf(stderr, "cannot connect to the bus: %s\n", std::strerror(-r));
+    std::exit(1);
+  }
+  return bus;
+}
+
+// The process id of the daemon as the bus reports it.
+inline std::optional<pid_t> daemonPid(sd_bus* bus) {
+  sd_bus_message* reply = nullptr;
+  sd_bus_error e = SD_BUS_ERROR_NULL;
+  int r = sd_bus_call_method(bus, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+                             "GetConnectionUnixProcessID", &e, &reply, "s", kService);
+  sd_bus_error_free(&e);
+  if (r < 0) return std::nullopt;
+  std::uint32_t pid = 0;
+  r = sd_bus_message_read(reply, "u", &pid);
+  sd_bus_message_unref(reply);
+  if (r < 0) return std::nullopt;
+  return static_cast<pid_t>(pid);
+}
+
+// utime + stime of a process in seconds.
+inline std::optional<double> cpuSeconds(pid_t pid) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  auto close = text.rfind(')');
+  if (close == std::string::npos) return std::nullopt;
+  std::istringstream fields(text.substr(close + 2));
+  std::string f;
+  unsigned long long utime = 0, stime = 0;
+  // Fields after the name: state(3) ... utime(14) stime(15).
+  for (int i = 3; i <= 15 && fields >> f; ++i) {
+    if (i == 14) utime = std::stoull(f);
+    if (i == 15) stime = std::stoull(f);
+  }
+  return static_cast<double>(utime + stime) / static_cast<double>(sysconf(_SC_CLK_TCK));
+}
+
+// Releases every waiting client thread at once.
+class StartGate {
+ public:
+  void wait() {
+    std::unique_lock lock(mu_);
+    cv_.wait(lock, [&] { return open_; });
+  }
+  void open() {
+    {
+      std::lock_guard lock(mu_);
+      open_ = true;
+    }
+    cv_.notify_all();
+  }
+
+ private:
+  std::mutex mu_;  // guards open_
+  std::condition_variable cv_;
+  bool open_ = false;
+};
+
+inline double secondsSince(std::chrono::steady_clock::time_point t) {
+  return std::chrono::duration<double>(std::chrono::steady_clock::now() - t).count();
+}
+
+}  // namespace vireo::bench
