@@ -1,7 +1,10 @@
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
+#include <thread>
 
+#include "dispatch/thread_pool.h"
 #include "fakes/service_fakes.h"
 
 namespace vireo {
@@ -430,6 +433,70 @@ TEST_F(ServiceTest, InvalidationBeforeRegistrationLeavesNoClientBehind) {
   EXPECT_TRUE(h.fake.analytics.events().empty());
   h.pump();  // registration, then the queued removal
   EXPECT_TRUE(h.delegate->getAllClients().empty());
+}
+
+}  // namespace
+}  // namespace vireo
+
+namespace vireo {
+namespace {
+
+using testing::FakeConnection;
+using testing::FakePlatform;
+
+// Clients call from their own threads while the defaults change, on the real pool:
+// every operation only queues, so all replies arrive and nothing races (run under
+// the sanitizers).
+TEST(ServiceThreadsTest, ConcurrentClientsAllGetTheirReplies) {
+  FakePlatform fake;
+  ThreadPoolDispatcher pool;
+  Platform platform{fake.logger, fake.tracer,   fake.clock,         fake.random,  pool,
+                    fake.telemetry, fake.analytics, fake.energyLog, fake.defaults, fake.notifications,
+                    fake.device,    fake.processes, fake.files,     fake.driverStats, fake.process};
+  auto env = std::make_shared<ReportingEnvironment>(platform);
+  auto delegate = VRReportingServiceDelegate::init(env);
+
+  constexpr int kClients = 4;
+  constexpr int kSessions = 25;
+  std::vector<std::unique_ptr<FakeConnection>> connections;
+  for (int i = 0; i < kClients; ++i) {
+    fake.processes.setName(100 + i, "client" + std::to_string(i));
+    connections.push_back(std::make_unique<FakeConnection>(100 + i, "<conn>"));
+    delegate->shouldAcceptNewConnection(*connections.back());
+  }
+
+  std::atomic<int> answers{0};
+  std::atomic<int> errors{0};
+  BoolReply onBool = [&](bool ok) { answers += ok ? 1 : 0; };
+  ErrorReply onSend = [&](std::optional<Error> e) { (e ? errors : answers) += 1; };
+  std::vector<std::thread> threads;
+  for (int i = 0; i < kClients; ++i) {
+    threads.emplace_back([&, i] {
+      VRReportingServiceProtocol& c = connections[i]->client();
+      for (std::int64_t id = i * 1000 + 1; id <= i * 1000 + kSessions; ++id) {
+        c.createReportingSession(id, onBool);
+        c.setServiceType(2, id, onBool);
+        c.startReportingSessionForID(id, onBool);
+        c.sendMessage(Dictionary{{"n", id}}, 0x40000003, 1, std::nullopt, onSend);
+        c.sendMessage(Dictionary{{"n", id}}, 0x40000003, 1, std::vector<std::int64_t>{id, id + 1}, onSend);
+        c.stopReportingSessionForID(id, onBool);
+        c.destroyReportingSession(id, onBool);
+      }
+    });
+  }
+  for (int k = 0; k < 10; ++k) {
+    fake.defaults.set("com.orvane.vireo", "device_name", "device" + std::to_string(k));
+    fake.notifications.post(kDefaultsNotification);
+  }
+  for (auto& t : threads) t.join();
+  for (auto& c : connections) c->invalidate();
+  EXPECT_TRUE(pool.drain(std::chrono::seconds(30)));
+
+  EXPECT_EQ(answers.load(), kClients * kSessions * 7);
+  EXPECT_EQ(errors.load(), 0);
+  EXPECT_TRUE(delegate->getAllClients().empty());
+  EXPECT_GE(fake.analytics.events().size(), static_cast<std::size_t>(kClients)) << "uptime events";
+  pool.shutdown();
 }
 
 }  // namespace
