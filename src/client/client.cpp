@@ -42,19 +42,21 @@ struct Connection {
     if (bus) sd_bus_flush_close_unref(bus);
   }
 
-  // Drains everything already received; called with mu held.
-  void drain() {
-    while (sd_bus_process(bus, nullptr) > 0) {
-    }
+  // Dispatches everything already received; called with mu held. True when
+  // something was dispatched.
+  bool drain() {
+    bool progress = false;
+    while (sd_bus_process(bus, nullptr) > 0) progress = true;
+    return progress;
   }
 
-  // Dispatches what has arrived, then sleeps on the socket for at most timeout
-  // without holding the lock, so other threads may call meanwhile.
+  // Dispatches what has arrived; when nothing had, sleeps on the socket for at most
+  // timeout without holding the lock, so other threads may call meanwhile.
   void pumpOnce(std::chrono::milliseconds timeout) {
     int fd;
     {
       std::lock_guard lock(mu);
-      drain();
+      if (drain()) return;
       fd = sd_bus_get_fd(bus);
     }
     if (fd < 0) return;

@@ -9,7 +9,7 @@ namespace vireo::ctl {
 
 namespace {
 
-using nlohmann::json;
+using json = nlohmann::ordered_json;
 
 json idsJson(const std::vector<std::int64_t>& ids) {
   json a = json::array();
@@ -49,9 +49,10 @@ bool Runner::fail(const Operation& op, const client::Error& e) {
 void Runner::reportArrivedStarts() {
   client_.pump(std::chrono::milliseconds(0));
   for (auto& [id, handles] : pending_) {
-    while (!handles.empty() && handles.front().ready()) {
-      auto r = handles.front().wait();
-      handles.pop_front();
+    for (auto& p : handles) {
+      if (p.reported || !p.handle.ready()) continue;
+      p.reported = true;
+      auto r = p.handle.wait();
       if (r)
         print("start " + std::to_string(id) + ": answered " + boolText(*r),
               json{{"op", "start"}, {"reporterID", id}, {"answered", *r}}.dump());
@@ -66,7 +67,8 @@ bool Runner::waitStart(const Operation& op) {
   auto it = pending_.find(op.id);
   if (it == pending_.end() || it->second.empty())
     return fail(op, {"com.orvane.vireoctl.NoPendingStart", "no start of this reporter ID is waiting", {}, 0});
-  client::StartHandle handle = it->second.front();
+  client::StartHandle handle = it->second.front().handle;
+  const bool reported = it->second.front().reported;
   std::optional<client::Result<bool>> r;
   if (op.seconds > 0)
     r = handle.waitFor(std::chrono::milliseconds(static_cast<long long>(op.seconds * 1000)));
@@ -74,6 +76,7 @@ bool Runner::waitStart(const Operation& op) {
     r = handle.wait();
   if (!r) return fail(op, {"org.freedesktop.DBus.Error.Timeout", "no answer within the timeout", {}, 0});
   it->second.pop_front();
+  if (reported) return true;
   if (!*r) return fail(op, r->error());
   print("start " + std::to_string(op.id) + ": answered " + boolText(**r),
         json{{"op", "start"}, {"reporterID", op.id}, {"answered", **r}}.dump());
@@ -112,7 +115,7 @@ bool Runner::run(const Operation& op) {
         if (!r) return fail(op, r.error());
         print("start " + idText + ": sent", json{{"op", "start"}, {"reporterID", op.id}, {"sent", true}}.dump());
       } else {
-        pending_[op.id].push_back(client_.startReportingSessionForID(op.id));
+        pending_[op.id].push_back({client_.startReportingSessionForID(op.id), false});
         if (op.startMode == StartMode::Wait) {
           Operation wait = op;
           wait.kind = OpKind::WaitStart;

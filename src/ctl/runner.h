@@ -31,8 +31,12 @@ class Runner {
   bool json_;
   std::FILE* out_;
   std::FILE* err_;
-  // Starts whose answer has not been printed yet, oldest first per reporter ID.
-  std::map<std::int64_t, std::deque<client::StartHandle>> pending_;
+  struct PendingStart {
+    client::StartHandle handle;
+    bool reported = false;  // its answer has been printed
+  };
+  // Starts not yet consumed by wait-start, oldest first per reporter ID.
+  std::map<std::int64_t, std::deque<PendingStart>> pending_;
 };
 
 }  // namespace vireo::ctl
