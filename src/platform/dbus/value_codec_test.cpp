@@ -1,0 +1,223 @@
+#include "platform/dbus/value_codec.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/dbus/bus.h"
+
+namespace vireo::dbus {
+namespace {
+
+// A bus on one end of a socket pair: enough for sd-bus to build and seal
+// messages, which are then read back without ever being sent.
+class ValueCodecTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds_), 0);
+    ASSERT_GE(sd_bus_new(bus_.out()), 0);
+    ASSERT_GE(sd_bus_set_fd(bus_.get(), fds_[0], fds_[0]), 0);
+    ASSERT_GE(sd_bus_start(bus_.get()), 0);
+  }
+  void TearDown() override {
+    sd_bus_close(bus_.get());  // nothing to flush: the peer never answers
+    bus_.reset();              // closes fds_[0]
+    close(fds_[1]);
+  }
+
+  MessageRef newMessage() {
+    MessageRef m;
+    EXPECT_GE(sd_bus_message_new_method_call(bus_.get(), m.out(), "com.example.Peer", "/", "com.example.Peer", "Call"),
+              0);
+    return m;
+  }
+  static void seal(const MessageRef& m) {
+    ASSERT_GE(sd_bus_message_seal(m.get(), 1, 0), 0);
+    ASSERT_GE(sd_bus_message_rewind(m.get(), true), 0);
+  }
+  // Writes value as a variant and reads it back.
+  Value roundTrip(const Value& value) {
+    MessageRef m = newMessage();
+    EXPECT_GE(appendVariant(m.get(), value), 0);
+    seal(m);
+    Value out;
+    BusError error;
+    EXPECT_EQ(readValue(m.get(), &out, error.get()), 1) << error.message();
+    return out;
+  }
+
+  // Top dictionary plus levels-1 nested arrays.
+  static Dictionary nested(int levels) {
+    Value inner = Value(Array{Value("leaf")});
+    for (int i = 2; i < levels; ++i) inner = Value(Array{inner});
+    return Dictionary{{"k", inner}};
+  }
+
+  int fds_[2] = {-1, -1};
+  BusRef bus_;
+};
+
+TEST_F(ValueCodecTest, ReadsBasicTypesKeepingSignedness) {
+  MessageRef m = newMessage();
+  ASSERT_GE(sd_bus_message_append(m.get(), "sogbynqiuxtd", "text", "/a/path", "a{sv}", 1, std::uint8_t{200},
+                                  std::int16_t{-2}, std::uint16_t{65535}, std::int32_t{-4}, std::uint32_t{4000000000u},
+                                  std::int64_t{-5}, std::uint64_t{18000000000000000000ull}, 2.5),
+            0);
+  seal(m);
+  const Value expected[] = {Value("text"),
+                            Value("/a/path"),
+                            Value("a{sv}"),
+                            Value(true),
+                            Value(std::uint64_t{200}),
+                            Value(std::int64_t{-2}),
+                            Value(std::uint64_t{65535}),
+                            Value(std::int64_t{-4}),
+                            Value(std::uint64_t{4000000000u}),
+                            Value(std::int64_t{-5}),
+                            Value(std::uint64_t{18000000000000000000ull}),
+                            Value(2.5)};
+  for (const Value& e : expected) {
+    Value v;
+    BusError error;
+    ASSERT_EQ(readValue(m.get(), &v, error.get()), 1) << error.message();
+    EXPECT_EQ(v, e) << e.text();
+    EXPECT_EQ(v.kind(), e.kind()) << e.text();
+  }
+  Value end;
+  BusError error;
+  EXPECT_EQ(readValue(m.get(), &end, error.get()), 0);
+}
+
+TEST_F(ValueCodecTest, ReadsContainers) {
+  MessageRef m = newMessage();
+  const std::uint8_t bytes[] = {0, 1, 255};
+  ASSERT_GE(sd_bus_message_append_array(m.get(), 'y', bytes, sizeof bytes), 0);
+  ASSERT_GE(sd_bus_message_append(m.get(), "a{iv}", 2, -1, "s", "minus", 7, "u", 7u), 0);
+  ASSERT_GE(sd_bus_message_append(m.get(), "a(si)", 2, "a", 1, "b", 2), 0);
+  ASSERT_GE(sd_bus_message_append(m.get(), "v", "v", "v", "x", std::int64_t{9}), 0);
+  ASSERT_GE(sd_bus_message_append(m.get(), "a{sv}", 0), 0);
+  seal(m);
+
+  Value v;
+  BusError error;
+  ASSERT_EQ(readValue(m.get(), &v, error.get()), 1);
+  EXPECT_EQ(v, Value(Data{0, 1, 255}));
+
+  ASSERT_EQ(readValue(m.get(), &v, error.get()), 1);
+  ASSERT_NE(v.asDictionary(), nullptr);
+  EXPECT_EQ(*v.asDictionary(), (Dictionary{{Value(-1), Value("minus")}, {Value(7), Value(7u)}}));
+
+  ASSERT_EQ(readValue(m.get(), &v, error.get()), 1);
+  EXPECT_EQ(v, Value(Array{Value(Array{Value("a"), Value(1)}), Value(Array{Value("b"), Value(2)})}));
+
+  ASSERT_EQ(readValue(m.get(), &v, error.get()), 1);  // variants unwrapped, however many
+  EXPECT_EQ(v, Value(std::int64_t{9}));
+
+  Dictionary empty{{"x", 1}};
+  ASSERT_EQ(readDictionary(m.get(), &empty, error.get()), 1);
+  EXPECT_TRUE(empty.empty());
+}
+
+TEST_F(ValueCodecTest, RoundTripsEveryKind) {
+  const Value values[] = {Value(true),
+                          Value(false),
+                          Value(std::int64_t{-1} << 62),
+                          Value(std::uint64_t{1} << 63),
+                          Value(-0.25),
+                          Value(""),
+                          Value("grüße"),
+                          Value(Data{}),
+                          Value(Data{9, 8, 7}),
+                          Value(Array{}),
+                          Value(Array{Value(1), Value("two"), Value(Array{Value(3.0)})}),
+                          Value(Dictionary{}),
+                          Value(Dictionary{{"a", 1}, {"b", Dictionary{{"c", Data{1}}}}}),
+                          Value(Dictionary{{Value(-3), Value("neg")}, {Value(4), Value("pos")}}),
+                          Value(Dictionary{{Value(3u), Value(true)}}),
+                          Value(Dictionary{{Value(true), Value(1)}}),
+                          Value(Dictionary{{Value(1.5), Value(1)}})};
+  for (const Value& v : values) {
+    Value back = roundTrip(v);
+    EXPECT_EQ(back, v) << v.text() << " came back as " << back.text();
+  }
+}
+
+TEST_F(ValueCodecTest, MixedKeysBecomePairs) {
+  Value mixed(Dictionary{{Value("s"), Value(1)}, {Value(2), Value("two")}});
+  EXPECT_EQ(roundTrip(mixed),
+            Value(Array{Value(Array{Value("s"), Value(1)}), Value(Array{Value(2), Value("two")})}));
+}
+
+TEST_F(ValueCodecTest, SixteenContainersAcceptedSeventeenRefused) {
+  for (int levels : {16, 17}) {
+    MessageRef m = newMessage();
+    ASSERT_GE(appendStringDictionary(m.get(), nested(levels)), 0);
+    ASSERT_GE(sd_bus_message_append(m.get(), "x", std::int64_t{1}), 0);
+    seal(m);
+    Dictionary d;
+    BusError error;
+    int r = readDictionary(m.get(), &d, error.get());
+    if (levels == 16) {
+      EXPECT_EQ(r, 1) << error.message();
+      EXPECT_EQ(Value(d), Value(nested(16)));
+    } else {
+      EXPECT_LT(r, 0);
+      EXPECT_STREQ(error.name(), kInvalidArgs);
+      EXPECT_NE(std::strstr(error.message(), "nested deeper than 16"), nullptr) << error.message();
+    }
+  }
+}
+
+TEST_F(ValueCodecTest, DataCountsAsAContainer) {
+  Value inner(Data{1});
+  for (int i = 2; i < 17; ++i) inner = Value(Array{inner});
+  MessageRef m = newMessage();
+  ASSERT_GE(appendStringDictionary(m.get(), Dictionary{{"k", inner}}), 0);
+  seal(m);
+  Dictionary d;
+  BusError error;
+  EXPECT_LT(readDictionary(m.get(), &d, error.get()), 0);
+  EXPECT_STREQ(error.name(), kInvalidArgs);
+}
+
+TEST_F(ValueCodecTest, RefusesFileDescriptorsAnywhere) {
+  MessageRef top = newMessage();
+  ASSERT_GE(sd_bus_message_append(top.get(), "h", 0), 0);
+  MessageRef inDict = newMessage();
+  ASSERT_GE(sd_bus_message_append(inDict.get(), "a{sv}", 1, "fd", "h", 0), 0);
+  MessageRef asKey = newMessage();
+  ASSERT_GE(sd_bus_message_append(asKey.get(), "a{hs}", 1, 0, "x"), 0);
+  for (MessageRef* m : {&top, &inDict, &asKey}) {
+    seal(*m);
+    Value v;
+    BusError error;
+    EXPECT_LT(readValue(m->get(), &v, error.get()), 0);
+    EXPECT_STREQ(error.name(), kInvalidArgs);
+    EXPECT_NE(std::strstr(error.message(), "file descriptors"), nullptr) << error.message();
+  }
+}
+
+TEST_F(ValueCodecTest, WritingRefusesWhatDBusCannotCarry) {
+  EXPECT_LT(appendVariant(newMessage().get(), Value("bad \xff utf-8")), 0);
+  EXPECT_LT(appendVariant(newMessage().get(), Value(Dictionary{{"k", Value("\xc3")}})), 0);
+  EXPECT_LT(appendVariant(newMessage().get(), Value()), 0);
+  EXPECT_LT(appendStringDictionary(newMessage().get(), Dictionary{{Value(1), Value(2)}}), 0);
+  Value deep("x");
+  for (int i = 0; i < 40; ++i) deep = Value(Array{deep});
+  EXPECT_LT(appendVariant(newMessage().get(), deep), 0);
+}
+
+TEST_F(ValueCodecTest, WrongTypeWhereDictionaryExpected) {
+  MessageRef m = newMessage();
+  ASSERT_GE(sd_bus_message_append(m.get(), "as", 1, "x"), 0);
+  seal(m);
+  Dictionary d;
+  BusError error;
+  EXPECT_LT(readDictionary(m.get(), &d, error.get()), 0);
+  EXPECT_STREQ(error.name(), kInvalidArgs);
+}
+
+}  // namespace
+}  // namespace vireo::dbus
