@@ -1,0 +1,108 @@
+// The daemon on the bus: owns com.orvane.vireo.Reporting1, exports the
+// reporting interface at /com/orvane/vireo/Reporting1, turns bus unique names
+// into client connections for the listener delegate, and delivers the Posted
+// notification signal (and SIGHUP) to the notification center.
+//
+// One thread runs the sd-event loop with the bus attached: the one that calls
+// run(), or the thread that start() makes. Method calls are parsed there and
+// handed to the connection's exported object; replies come back from other
+// threads through the mailbox.
+//
+// SIGTERM and SIGINT end the loop, SIGHUP posts the defaults notification. They
+// must be blocked in every thread of the process (blockServiceSignals() before
+// any thread is made), so that only the loop receives them.
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <string>
+#include <thread>
+
+#include "daemon/bus_choice.h"
+#include "daemon/bus_mailbox.h"
+#include "daemon/client_registry.h"
+#include "daemon/notification_center.h"
+#include "platform/connection.h"
+#include "platform/dbus/bus.h"
+#include "platform/logger.h"
+
+namespace vireo {
+class VRReportingServiceProtocol;
+}
+
+namespace vireo::daemon {
+
+class PendingCall;
+
+inline constexpr const char* kServiceName = "com.orvane.vireo.Reporting1";
+inline constexpr const char* kObjectPath = "/com/orvane/vireo/Reporting1";
+inline constexpr const char* kInterfaceName = "com.orvane.vireo.Reporting1";
+inline constexpr const char* kNotifyPath = "/com/orvane/Notify1";
+inline constexpr const char* kNotifyInterface = "com.orvane.Notify1";
+inline constexpr const char* kDefaultsNotification = "com.orvane.vireo.reporting";
+inline constexpr const char* kReportingDisabledError = "com.orvane.audio.reporting.ReportingDisabled";
+
+// Blocks SIGTERM, SIGINT and SIGHUP in the calling thread (and the threads it makes).
+void blockServiceSignals();
+
+class BusService {
+ public:
+  struct Options {
+    BusKind bus = BusKind::Session;
+    // When set, this address is used instead of the standard bus (tests).
+    std::string address;
+    // Handle SIGTERM, SIGINT and SIGHUP in the loop.
+    bool handleSignals = true;
+  };
+
+  BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications);
+  ~BusService();  // stops, joins and closes
+  BusService(const BusService&) = delete;
+  BusService& operator=(const BusService&) = delete;
+
+  // Connects, exports the object, subscribes to the bus driver's name changes
+  // and the notification signal, and takes the well-known name. Returns 0, or
+  // -errno after logging why.
+  int open(const Options& options);
+  // Runs the loop on the calling thread until stop(), SIGTERM or SIGINT, or the
+  // loss of the bus. Returns 0 for a requested end.
+  int run();
+  // Runs the loop on a thread of its own.
+  void start();
+  // Asks the loop to end (any thread) and waits for the thread start() made.
+  void stop();
+  // After the loop: stops taking calls and leaves the bus. Replies made later
+  // are dropped. Idempotent.
+  void close();
+
+ private:
+  friend struct BusServiceAccess;
+  struct CredentialLookup;
+  using Invocation = std::function<void(VRReportingServiceProtocol& object, const std::shared_ptr<PendingCall>&)>;
+
+  void submit(sd_bus_message* call, Invocation invocation);
+  void lookupCredentials(const std::string& name);
+  static int onCredentials(sd_bus_message* reply, void* userdata, sd_bus_error* error);
+  static int onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
+  static int onPosted(sd_bus_message* m, void* userdata, sd_bus_error* error);
+  static int onMailbox(sd_event_source* s, int fd, std::uint32_t revents, void* userdata);
+  static int onSignal(sd_event_source* s, const struct signalfd_siginfo* info, void* userdata);
+  int connect(const Options& options);
+
+  Logger& logger_;
+  NotificationCenter& notifications_;
+  ClientRegistry registry_;                  // bus thread only
+  std::shared_ptr<BusMailbox> mailbox_ = std::make_shared<BusMailbox>();
+  // The sd-bus and sd-event objects below belong to the bus thread while the loop
+  // runs, and to close() (through the closed mailbox) after it.
+  dbus::BusRef bus_;
+  dbus::EventRef event_;
+  dbus::SlotRef objectSlot_, nameOwnerSlot_, postedSlot_;
+  dbus::EventSourceRef mailboxSource_, termSource_, intSource_, hupSource_;
+  std::map<std::string, std::unique_ptr<CredentialLookup>> lookups_;  // by name; bus thread only
+  std::thread thread_;  // the loop's thread when start() made one; owner's thread only
+  bool closed_ = false; // owner's thread only
+};
+
+}  // namespace vireo::daemon
