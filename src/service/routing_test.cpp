@@ -129,7 +129,9 @@ TEST_F(RoutingTest, EmptyZeroOrUnknownListsSendNothing) {
   EXPECT_TRUE(h.fake.analytics.events().empty());
   EXPECT_EQ(payloads(1), 0);
   EXPECT_EQ(payloads(3), 0);
-  EXPECT_EQ(h.fake.logger.count("failed to find reporting session 99"), 1u);
+  auto misses = h.fake.logger.matching("failed to find reporting session 99");
+  ASSERT_EQ(misses.size(), 1u);
+  EXPECT_EQ(misses[0].level, LogLevel::Error);
   EXPECT_FALSE(h.fake.logger.contains("failed to find reporting session 0"));
 }
 
