@@ -321,7 +321,9 @@ StartHandle Client::startReportingSessionForID(std::int64_t id) {
   }
   conn_->pending.fetch_add(1);
   sd_bus_slot_set_destroy_callback(slot, PendingCall::onDestroy);
+  // The bus keeps the slot from here on; drop the reference the call gave us.
   sd_bus_slot_set_floating(slot, 1);
+  sd_bus_slot_unref(slot);
   return handle;
 }
 
@@ -374,7 +376,9 @@ Status Client::sendMessageAsync(const Dictionary& payload, std::uint32_t categor
   }
   conn_->pending.fetch_add(1);
   sd_bus_slot_set_destroy_callback(slot, PendingCall::onDestroy);
+  // The bus keeps the slot from here on; drop the reference the call gave us.
   sd_bus_slot_set_floating(slot, 1);
+  sd_bus_slot_unref(slot);
   return Done{};
 }
 
