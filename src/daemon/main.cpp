@@ -1,0 +1,132 @@
+// vireo-reportingd: the reporting daemon of the audio stack.
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <functional>
+#include <memory>
+
+#include "daemon/bus_choice.h"
+#include "daemon/bus_service.h"
+#include "daemon/notification_center.h"
+#include "dispatch/thread_pool.h"
+#include "platform/linux/defaults_store.h"
+#include "platform/linux/device_properties.h"
+#include "platform/linux/diagnostic_files.h"
+#include "platform/linux/linux_logger.h"
+#include "platform/linux/paths.h"
+#include "platform/linux/process_table.h"
+#include "platform/linux/stats_tree.h"
+#include "platform/linux/store/local_services.h"
+#include "platform/linux/system_clock.h"
+#include "platform/linux/usdt_tracer.h"
+#include "platform/platform.h"
+#include "service/service_delegate.h"
+#include "vocabulary/reporting_environment.h"
+
+namespace {
+
+using namespace vireo;
+using namespace std::chrono_literals;
+
+// How long queued work may still run after SIGTERM before the store is closed.
+constexpr auto kDrainBudget = 3s;
+// How long killService: waits for the store to commit before the process ends.
+constexpr auto kKillFlushBudget = 500ms;
+
+// killService: ends the process at once, after committing what the store holds.
+class ExitProcessControl final : public ProcessControl {
+ public:
+  explicit ExitProcessControl(std::function<void()> beforeExit) : beforeExit_(std::move(beforeExit)) {}
+  [[noreturn]] void exitProcess(int status) override {
+    if (beforeExit_) beforeExit_();
+    _exit(status);
+  }
+
+ private:
+  const std::function<void()> beforeExit_;
+};
+
+void usage(FILE* out) {
+  std::fprintf(out,
+               "Usage: vireo-reportingd [--help] [--version]\n"
+               "\n"
+               "The Vireo audio reporting daemon. Serves com.orvane.vireo.Reporting1 on the bus it\n"
+               "was activated on, else the system bus as root and the session bus otherwise.\n"
+               "\n"
+               "Environment:\n"
+               "  VIREO_BUS=system|session   the bus to serve on\n"
+               "  VIREO_VERBOSE=SCOPES       debug logging: reporting_server_verbose,\n"
+               "                             reporting_session_verbose, reporting_driver_verbose, or all\n"
+               "  CONFIGURATION_DIRECTORY, STATE_DIRECTORY, LOGS_DIRECTORY, RUNTIME_DIRECTORY\n"
+               "                             the service directories (set by systemd)\n"
+               "\n"
+               "Signals: SIGHUP re-reads the defaults; SIGTERM and SIGINT stop the daemon.\n");
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  for (int i = 1; i < argc; ++i) {
+    if (std::strcmp(argv[i], "--help") == 0 || std::strcmp(argv[i], "-h") == 0) {
+      usage(stdout);
+      return 0;
+    }
+    if (std::strcmp(argv[i], "--version") == 0) {
+      std::printf("vireo-reportingd %s\n", VIREO_VERSION);
+      return 0;
+    }
+    std::fprintf(stderr, "vireo-reportingd: unknown argument '%s'\n", argv[i]);
+    usage(stderr);
+    return 64;  // EX_USAGE
+  }
+
+  // Before any thread exists, so that only the bus loop receives them.
+  daemon::blockServiceSignals();
+
+  auto logger = linux_platform::LinuxLogger::fromEnvironment();
+  const auto directories = linux_platform::ServiceDirectories::fromEnvironment();
+  VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Info, "main",
+         "vireo-reportingd %s: configuration %s, state %s, logs %s, runtime %s", VIREO_VERSION,
+         directories.configuration.c_str(), directories.state.c_str(), directories.logs.c_str(),
+         directories.runtime.c_str());
+
+  linux_platform::UsdtTracer tracer;
+  linux_platform::SystemClock clock;
+  linux_platform::SystemRandom random;
+  ThreadPoolDispatcher dispatcher;
+  linux_platform::LocalStoreServices store(directories, *logger, clock);
+  linux_platform::SuiteFileDefaultsStore defaults(directories.configuration);
+  daemon::NotificationCenter notifications;
+  linux_platform::DevicePropertiesFile device(directories.configuration);
+  linux_platform::ProcfsProcessTable processes;
+  linux_platform::LinuxDiagnosticFiles files(directories.logs);
+  linux_platform::StatsTreeLibrary driverStats(directories.runtime + "/stats");
+  ExitProcessControl process([&store] { store.store->flush(kKillFlushBudget); });
+
+  Platform platform{*logger,  tracer,        clock,  random,    dispatcher,  store.telemetry, store.analytics,
+                    store.energyLog, defaults, notifications, device, processes, files, driverStats, process};
+  auto environment = std::make_shared<ReportingEnvironment>(platform);
+  auto delegate = VRReportingServiceDelegate::init(environment);
+  if (!delegate) {
+    VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Error, "main", "the service could not be initialised");
+    return 1;
+  }
+
+  daemon::BusService service(*logger, *delegate, notifications);
+  daemon::BusService::Options options;
+  options.bus = daemon::chooseBus(std::getenv("VIREO_BUS"), std::getenv("DBUS_STARTER_BUS_TYPE"), geteuid() == 0);
+  if (service.open(options) < 0) return 1;
+
+  int loop = service.run();
+  // Stop taking calls, let queued work finish for a while, then commit the store.
+  service.close();
+  if (!dispatcher.drain(kDrainBudget))
+    VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Default, "main", "queued work still running after %lld ms",
+           static_cast<long long>(std::chrono::milliseconds(kDrainBudget).count()));
+  dispatcher.shutdown();
+  store.close();
+  return loop == 0 ? 0 : 1;
+}
