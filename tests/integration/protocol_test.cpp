@@ -202,8 +202,8 @@ class RawBus {
 Dictionary nestedPayload(int containers) {
   // The payload itself is the first container.
   Value v("leaf");
-  for (int i = 1; i < containers; ++i) v = Value(Dictionary{{"n", v}});
-  return v.asDictionary() ? *v.asDictionary() : Dictionary{{"leaf", v}};
+  for (int i = 0; i < containers; ++i) v = Value(Dictionary{{"n", v}});
+  return *v.asDictionary();
 }
 
 TEST_F(ProtocolTest, BadInputIsRefusedAndTheServiceGoesOn) {
