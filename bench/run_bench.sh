@@ -36,7 +36,7 @@ cleanup() {
 }
 trap cleanup EXIT INT TERM
 
-dbus-daemon --session --nofork --print-address=3 --address="unix:dir=$TMP" 3>"$TMP/address" &
+dbus-daemon --session --nofork --print-address=3 --address="unix:dir=$TMP" 3>"$TMP/address" 2>"$TMP/dbus-daemon.log" &
 BUS_PID=$!
 for _ in $(seq 100); do [ -s "$TMP/address" ] && break; sleep 0.05; done
 DBUS_SESSION_BUS_ADDRESS=$(head -n1 "$TMP/address")
