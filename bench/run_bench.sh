@@ -34,7 +34,8 @@ cleanup() {
   [ -n "$BUS_PID" ] && kill "$BUS_PID" 2>/dev/null && wait "$BUS_PID" 2>/dev/null || true
   if [ -n "${VIREO_BENCH_KEEP:-}" ]; then echo "kept $TMP"; else rm -rf "$TMP"; fi
 }
-trap cleanup EXIT INT TERM
+trap cleanup EXIT
+trap 'exit 1' HUP INT PIPE TERM
 
 dbus-daemon --session --nofork --print-address=3 --address="unix:dir=$TMP" 3>"$TMP/address" 2>"$TMP/dbus-daemon.log" &
 BUS_PID=$!
