@@ -208,6 +208,9 @@ class PrivateBus {
     pid_ = fork();
     if (pid_ == 0) {
       // Ends with the test, however the test ends; keeps quiet on the test's output.
+      sigset_t none;
+      sigemptyset(&none);
+      sigprocmask(SIG_SETMASK, &none, nullptr);  // the suite blocks SIGTERM
       prctl(PR_SET_PDEATHSIG, SIGTERM);
       int null = open("/dev/null", O_RDWR);
       dup2(null, STDOUT_FILENO);
@@ -245,7 +248,11 @@ dbus::BusRef connectClient(const std::string& address) {
 
 class BusServiceTest : public ::testing::Test {
  protected:
-  static void SetUpTestSuite() { bus_ = new PrivateBus(); }
+  static void SetUpTestSuite() {
+    // Before any thread of the suite exists, as the daemon does.
+    blockServiceSignals();
+    bus_ = new PrivateBus();
+  }
   static void TearDownTestSuite() {
     delete bus_;
     bus_ = nullptr;
@@ -254,7 +261,6 @@ class BusServiceTest : public ::testing::Test {
   void SetUp() override {
     BusService::Options options;
     options.address = bus_->address();
-    options.handleSignals = false;
     ASSERT_EQ(service_.open(options), 0);
     service_.start();
     client_ = connectClient(bus_->address());
@@ -472,6 +478,21 @@ TEST_F(BusServiceTest, PostedSignalReachesRegistrationsOfItsNameOnly) {
   }));
   std::lock_guard lock(mutex);
   EXPECT_EQ(got, std::vector<std::string>{"defaults " + std::to_string(token)});
+}
+
+TEST_F(BusServiceTest, HangupPostsTheDefaultsNotificationAndTerminateEndsTheLoop) {
+  std::atomic<int> delivered{0};
+  notifications_.registerDispatch(kDefaultsNotification, std::make_shared<RecordingQueue>(), [&](int) { ++delivered; },
+                                  nullptr);
+  kill(getpid(), SIGHUP);
+  ASSERT_TRUE(eventually([&] { return delivered == 1; }));
+  kill(getpid(), SIGTERM);
+  ASSERT_TRUE(eventually([&] {
+    std::lock_guard lock(logger_.mutex);
+    return !logger_.lines.empty() && logger_.lines.back().find("shutting down") != std::string::npos;
+  }));
+  service_.stop();  // returns: the loop has ended
+  EXPECT_EQ(delivered, 1);
 }
 
 Dictionary nested(int levels) {
