@@ -108,25 +108,30 @@ int main(int argc, char** argv) {
 
   Platform platform{*logger,  tracer,        clock,  random,    dispatcher,  store.telemetry, store.analytics,
                     store.energyLog, defaults, notifications, device, processes, files, driverStats, process};
+  // The pool's closures use everything above: it stops before any of it goes away.
+  auto finish = [&](int status) {
+    if (!dispatcher.drain(kDrainBudget))
+      VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Default, "main", "queued work still running after %lld ms",
+             static_cast<long long>(std::chrono::milliseconds(kDrainBudget).count()));
+    dispatcher.shutdown();
+    store.close();
+    return status;
+  };
+
   auto environment = std::make_shared<ReportingEnvironment>(platform);
   auto delegate = VRReportingServiceDelegate::init(environment);
   if (!delegate) {
     VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Error, "main", "the service could not be initialised");
-    return 1;
+    return finish(1);
   }
 
   daemon::BusService service(*logger, *delegate, notifications);
   daemon::BusService::Options options;
   options.bus = daemon::chooseBus(std::getenv("VIREO_BUS"), std::getenv("DBUS_STARTER_BUS_TYPE"), geteuid() == 0);
-  if (service.open(options) < 0) return 1;
+  if (service.open(options) < 0) return finish(1);
 
   int loop = service.run();
   // Stop taking calls, let queued work finish for a while, then commit the store.
   service.close();
-  if (!dispatcher.drain(kDrainBudget))
-    VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Default, "main", "queued work still running after %lld ms",
-           static_cast<long long>(std::chrono::milliseconds(kDrainBudget).count()));
-  dispatcher.shutdown();
-  store.close();
-  return loop == 0 ? 0 : 1;
+  return finish(loop == 0 ? 0 : 1);
 }
