@@ -191,7 +191,9 @@ std::size_t Value::hash() const noexcept {
 // ---- Dictionary ----
 
 namespace {
-constexpr std::size_t kIndexThreshold = 16;
+// Payloads are typically a few dozen entries: a linear scan beats building a hash
+// table for each one. Larger dictionaries (a hostile client) get the index.
+constexpr std::size_t kIndexThreshold = 64;
 
 struct ValueHash {
   std::size_t operator()(const Value* v) const noexcept { return v->hash(); }
@@ -319,7 +321,12 @@ namespace {
 // Strings reach us already checked as UTF-8 by the bus; control characters are escaped.
 void appendJsonString(std::string& out, std::string_view s) {
   out += '"';
-  for (unsigned char c : s) {
+  std::size_t run = 0;  // start of the pending run of characters that need no escape
+  for (std::size_t i = 0; i < s.size(); ++i) {
+    const auto c = static_cast<unsigned char>(s[i]);
+    if (c >= 0x20 && c != '"' && c != '\\') continue;
+    out.append(s.data() + run, i - run);
+    run = i + 1;
     switch (c) {
       case '"': out += "\\\""; break;
       case '\\': out += "\\\\"; break;
@@ -329,15 +336,12 @@ void appendJsonString(std::string& out, std::string_view s) {
       case '\b': out += "\\b"; break;
       case '\f': out += "\\f"; break;
       default:
-        if (c < 0x20) {
-          out += "\\u00";
-          out += kHex[c >> 4];
-          out += kHex[c & 15];
-        } else {
-          out += static_cast<char>(c);
-        }
+        out += "\\u00";
+        out += kHex[c >> 4];
+        out += kHex[c & 15];
     }
   }
+  out.append(s.data() + run, s.size() - run);
   out += '"';
 }
 

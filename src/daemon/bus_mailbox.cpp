@@ -18,9 +18,11 @@ void BusMailbox::post(Task task) {
   {
     std::lock_guard lock(mutex_);
     if (!closed_) {
+      // Only the first task of a batch signals: the bus thread drains them all.
+      const bool first = tasks_.empty();
       tasks_.push_back(std::move(task));
       std::uint64_t one = 1;
-      if (fd_ >= 0 && write(fd_, &one, sizeof one) < 0) {
+      if (first && fd_ >= 0 && write(fd_, &one, sizeof one) < 0) {
         // Already signalled (counter full); the bus thread will drain anyway.
       }
       return;

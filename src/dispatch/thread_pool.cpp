@@ -101,6 +101,7 @@ class ThreadPoolDispatcher::Core {
   void blockingEnded();
   bool popReadyLocked(Ready& out);
   bool hasReadyLocked() const;
+  bool shouldWakeLocked(bool hadReady) const;
   // Starts one worker; false when the thread could not be made.
   bool spawnLocked();
   std::vector<std::unique_ptr<Worker>> takeFinishedLocked();
@@ -305,6 +306,9 @@ void ThreadPoolDispatcher::Core::blockingBegan() {
     if (threads_ - blocked_ < options_.coreWorkers && threads_ < options_.coreWorkers + options_.maxExtraWorkers) {
       finished = takeFinishedLocked();
       spawnLocked();
+    } else if (hasReadyLocked()) {
+      // This worker submitted without waking anyone; an idle worker takes over.
+      workCv_.notify_one();
     }
   }
   for (auto& w : finished) w->thread.join();
@@ -322,10 +326,20 @@ void ThreadPoolDispatcher::Core::taskFinished() {
   }
 }
 
+bool ThreadPoolDispatcher::Core::shouldWakeLocked(bool hadReady) const {
+  // A worker that submits picks the item up itself once its closure returns, so
+  // waking another thread only pays when there is already a backlog. This turns a
+  // pipeline of small closures into batches instead of thread ping-pong. A worker
+  // that goes on to block hands its backlog over in blockingBegan().
+  return !onWorkerThread() || hadReady;
+}
+
 void ThreadPoolDispatcher::Core::submitQueue(std::shared_ptr<PoolQueue> queue, QoS qos) {
+  bool wake = false;
   {
     std::lock_guard lock(mu_);
     if (!stopping()) {
+      wake = shouldWakeLocked(hasReadyLocked());
       ready_[classIndex(qos)].push_back(Ready{std::move(queue), nullptr});
       queue = nullptr;
     }
@@ -334,15 +348,17 @@ void ThreadPoolDispatcher::Core::submitQueue(std::shared_ptr<PoolQueue> queue, Q
     queue->clear();
     return;
   }
-  workCv_.notify_one();
+  if (wake) workCv_.notify_one();
 }
 
 void ThreadPoolDispatcher::Core::submitTask(Task task, QoS qos) {
   if (!task || stopping()) return;
   taskAdded();
+  bool wake = false;
   {
     std::lock_guard lock(mu_);
     if (!stopping()) {
+      wake = shouldWakeLocked(hasReadyLocked());
       ready_[classIndex(qos)].push_back(Ready{nullptr, std::move(task)});
       task = nullptr;
     }
@@ -352,7 +368,7 @@ void ThreadPoolDispatcher::Core::submitTask(Task task, QoS qos) {
     taskFinished();
     return;
   }
-  workCv_.notify_one();
+  if (wake) workCv_.notify_one();
 }
 
 void ThreadPoolDispatcher::Core::submitDelayed(std::chrono::nanoseconds delay, Task task) {

@@ -175,25 +175,28 @@ void VRReportingSession::sendMessage(const Dictionary& message, std::uint32_t ca
                                      bool /*sync: delivery is always asynchronous*/, BoolReply reply) {
   VR_DEBUG(env_->logger(), LogScope::Session, "-[VRReportingSession sendMessage:category:type:sync:reply:]",
            "sending message for session owned by %lli", static_cast<long long>(reporterID_));
-  Dictionary cleaned = cleanPayloadKeys(message);
+  // One cleaned payload, shared by the aggregation list and the delivery closure.
+  const Value cleaned(cleanPayloadKeys(message));
   std::string identifier = messageIdForCategory(category, type);
   if (auto payloads = aggregatedPayloadData()) {
     Dictionary entry;
-    entry.set(Value(std::move(identifier)), Value(cleaned));
+    entry.set(Value(std::move(identifier)), cleaned);
     std::lock_guard<std::mutex> guard(payloads->lock);
     payloads->entries.emplace_back(std::move(entry));
   }
   env_->platform.tracer.emit(trace::kSessionSend);
 
   const bool submittedWhileStarted = started_.load();
-  skylarkReportingQueue_->async([self = shared_from_this(), cleaned = std::move(cleaned), received = message,
+  // The message as received only appears in a debug line.
+  Value received = env_->logger().verbose(LogScope::Session) ? Value(message) : Value();
+  skylarkReportingQueue_->async([self = shared_from_this(), cleaned, received = std::move(received),
                                  submittedWhileStarted, category, type] {
-    self->deliver(cleaned, received, submittedWhileStarted, category, type);
+    self->deliver(*cleaned.asDictionary(), received, submittedWhileStarted, category, type);
   });
   if (reply) reply(false);
 }
 
-void VRReportingSession::deliver(const Dictionary& cleaned, const Dictionary& received, bool submittedWhileStarted,
+void VRReportingSession::deliver(const Dictionary& cleaned, const Value& received, bool submittedWhileStarted,
                                  std::uint32_t category, std::uint16_t type) {
   static constexpr const char* kLabel = "-[VRReportingSession sendMessage:category:type:sync:reply:]_block_invoke";
   Logger& logger = env_->logger();
@@ -217,7 +220,7 @@ void VRReportingSession::deliver(const Dictionary& cleaned, const Dictionary& re
   // A refused send is dropped silently: nothing retries it.
   if (telemetry->sendMessage(static_cast<std::uint16_t>(category & 0xFFFFu), type, cleaned, &error)) {
     VR_DEBUG(logger, LogScope::Session, kLabel, "SkylarkReportingAgent %s : message %s : category %i : type %i",
-             telemetry->description().c_str(), Value(received).text().c_str(), static_cast<int>(category),
+             telemetry->description().c_str(), received.text().c_str(), static_cast<int>(category),
              static_cast<int>(type));
   }
 }

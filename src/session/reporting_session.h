@@ -94,7 +94,7 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
   void startBackendSession(const Dictionary& userInfo, const std::string& serviceName, bool backendFound);
   // Orientation tracking needs the orientation service, which this platform lacks.
   bool shouldReportOrientation() const { return false; }
-  void deliver(const Dictionary& cleaned, const Dictionary& received, bool submittedWhileStarted,
+  void deliver(const Dictionary& cleaned, const Value& received, bool submittedWhileStarted,
                std::uint32_t category, std::uint16_t type);
 
   const std::shared_ptr<ReportingEnvironment> env_;
