@@ -92,8 +92,6 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
                      std::vector<std::int32_t> processIdentifiers);
   // The backend-session closure run on skylarkReportingQueue after start.
   void startBackendSession(const Dictionary& userInfo, const std::string& serviceName, bool backendFound);
-  // Orientation tracking needs the orientation service, which this platform lacks.
-  bool shouldReportOrientation() const { return false; }
   void deliver(const Dictionary& cleaned, const Value& received, bool submittedWhileStarted,
                std::uint32_t category, std::uint16_t type);
 
@@ -115,7 +113,6 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
   std::shared_ptr<AggregatedPayloads> aggregatedPayloadData_;
   Dictionary messageTypeCounts_;
   std::string serviceName_ = "unknown";
-  std::optional<std::string> orientationCallbackID_;
   std::shared_ptr<TelemetrySession> skylarkReportingSession_;
   std::shared_ptr<HierarchyToken> skylarkReportingAgentToken_;
 };
