@@ -125,33 +125,19 @@ TEST(SerialQueue, TenThousandQueuesShareAFewThreads) {
   EXPECT_EQ(pool.workerCount(), 3u);
 }
 
-TEST(SerialQueue, ThrowingClosureDoesNotStopItsQueueOrThePool) {
-  ThreadPoolDispatcher pool(small(1));
-  auto q = pool.makeSerialQueue("throws", QoS::Default);
-  std::atomic<int> after{0};
-  q->async([] { throw std::runtime_error("boom"); });
-  q->async([] { throw 42; });
-  q->async([&] { ++after; });
-  pool.asyncLowPriority(0ns, [] { throw std::runtime_error("boom"); });
-  pool.asyncLowPriority(0ns, [&] { ++after; });
-  q->async(Task{});  // an empty closure is ignored
-  ASSERT_TRUE(pool.drain(10s));
-  EXPECT_EQ(after.load(), 2);
-}
-
-// Both core workers block; the other queues still complete thanks to stand-ins,
-// and the stand-ins leave once idle.
-TEST(BlockingRegion, BlockedQueuesDoNotStallOtherQueues) {
+TEST(BlockingRegion, BlockedQueuesDoNotStallOtherQueuesAndStandInsAreCapped) {
   ThreadPoolDispatcher::Options o = small(2);
   o.extraIdleTimeout = 50ms;
+  o.maxExtraWorkers = 2;
   ThreadPoolDispatcher pool(o);
   std::promise<void> release;
   std::shared_future<void> released = release.get_future().share();
+  // Both core workers block; the other queues still complete thanks to stand-ins.
   Countdown entered(2);
-  std::vector<std::shared_ptr<SerialQueue>> blockers;
+  std::vector<std::shared_ptr<SerialQueue>> queues;
   for (int i = 0; i < 2; ++i) {
-    blockers.push_back(pool.makeSerialQueue("blocked", QoS::Utility));
-    blockers.back()->async([&, released] {
+    queues.push_back(pool.makeSerialQueue("blocked", QoS::Utility));
+    queues.back()->async([&, released] {
       BlockingRegion outer;
       BlockingRegion nested;  // counted once
       entered.arrive();
@@ -159,133 +145,112 @@ TEST(BlockingRegion, BlockedQueuesDoNotStallOtherQueues) {
     });
   }
   ASSERT_TRUE(entered.wait());
-
   Countdown others(100);
-  std::vector<std::shared_ptr<SerialQueue>> queues;
   for (int i = 0; i < 100; ++i) {
     queues.push_back(pool.makeSerialQueue("free", QoS::Default));
     queues.back()->async([&] { others.arrive(); });
   }
   EXPECT_TRUE(others.wait());
   EXPECT_GE(pool.workerCount(), 3u);
+
+  // Blocking stand-ins too: never more than maxExtraWorkers of them.
+  Countdown standIns(2);
+  std::atomic<int> done{0};
+  for (int i = 0; i < 4; ++i) {
+    queues.push_back(pool.makeSerialQueue("capped", QoS::Default));
+    queues.back()->async([&, released] {
+      BlockingRegion region;
+      standIns.arrive();
+      released.wait_for(20s);
+      ++done;
+    });
+  }
+  ASSERT_TRUE(standIns.wait());
+  std::this_thread::sleep_for(50ms);
+  EXPECT_EQ(pool.workerCount(), 4u);
+  EXPECT_EQ(done.load(), 0);
   EXPECT_FALSE(pool.drain(20ms));  // the blocked closures are still pending
 
   release.set_value();
   ASSERT_TRUE(pool.drain(10s));
+  EXPECT_EQ(done.load(), 4);
+  // The stand-ins leave once idle.
   auto deadline = std::chrono::steady_clock::now() + 10s;
   while (pool.workerCount() > 2 && std::chrono::steady_clock::now() < deadline) std::this_thread::sleep_for(10ms);
   EXPECT_EQ(pool.workerCount(), 2u);
 }
 
-TEST(BlockingRegion, StandInsAreCapped) {
-  ThreadPoolDispatcher::Options o = small(1);
-  o.maxExtraWorkers = 2;
-  ThreadPoolDispatcher pool(o);
-  std::promise<void> release;
-  std::shared_future<void> released = release.get_future().share();
-  Countdown entered(3);
-  std::atomic<int> done{0};
-  std::vector<std::shared_ptr<SerialQueue>> queues;
-  for (int i = 0; i < 6; ++i) {
-    queues.push_back(pool.makeSerialQueue("capped", QoS::Default));
-    queues.back()->async([&, released] {
-      BlockingRegion region;
-      entered.arrive();
-      released.wait_for(20s);
-      ++done;
-    });
-  }
-  ASSERT_TRUE(entered.wait());
-  std::this_thread::sleep_for(50ms);
-  EXPECT_EQ(pool.workerCount(), 3u);
-  EXPECT_EQ(done.load(), 0);
-  release.set_value();
-  ASSERT_TRUE(pool.drain(10s));
-  EXPECT_EQ(done.load(), 6);
-}
-
-TEST(LowPriority, DelayedTasksRunNoEarlierThanTheirDelay) {
-  ThreadPoolDispatcher pool(small(2));
+// Delayed tasks, submitted out of order, run no earlier than their delay and
+// side by side: each waits until all have started.
+TEST(LowPriority, DelayedTasksRunNoEarlierThanTheirDelayAndConcurrently) {
+  ThreadPoolDispatcher pool(small(3));
   auto start = std::chrono::steady_clock::now();
   std::mutex mu;  // guards elapsed
   std::vector<std::pair<std::chrono::milliseconds, std::chrono::steady_clock::duration>> elapsed;
-  Countdown done(3);
+  Countdown started(3);
+  std::atomic<int> overlapped{0};
   for (auto delay : {120ms, 40ms, 80ms}) {
     pool.asyncLowPriority(delay, [&, delay] {
-      std::lock_guard lock(mu);
-      elapsed.emplace_back(delay, std::chrono::steady_clock::now() - start);
-      done.arrive();
+      {
+        std::lock_guard lock(mu);
+        elapsed.emplace_back(delay, std::chrono::steady_clock::now() - start);
+      }
+      started.arrive();
+      if (started.wait(10s)) ++overlapped;
     });
   }
-  ASSERT_TRUE(done.wait());
+  ASSERT_TRUE(started.wait());
+  ASSERT_TRUE(pool.drain(10s));
+  EXPECT_EQ(overlapped.load(), 3);
   std::lock_guard lock(mu);
   ASSERT_EQ(elapsed.size(), 3u);
   for (auto& [delay, took] : elapsed) EXPECT_GE(took, delay);
 }
 
-TEST(LowPriority, TasksRunConcurrently) {
-  ThreadPoolDispatcher pool(small(2));
-  // Each task waits until both have started: only possible if they overlap.
-  Countdown started(2);
-  std::atomic<int> overlapped{0};
-  for (int i = 0; i < 2; ++i) {
-    pool.asyncLowPriority(i == 0 ? 0ns : std::chrono::nanoseconds(10ms), [&] {
-      started.arrive();
-      if (started.wait(10s)) ++overlapped;
-    });
-  }
-  ASSERT_TRUE(pool.drain(30s));
-  EXPECT_EQ(overlapped.load(), 2);
-}
-
-TEST(Drain, WaitsForCascadedWorkButNotForFutureDelays) {
-  ThreadPoolDispatcher pool(small(2));
-  auto a = pool.makeSerialQueue("a", QoS::Default);
-  auto b = pool.makeSerialQueue("b", QoS::Background);
-  std::atomic<int> ran{0};
-  std::atomic<bool> delayedRan{false};
-  pool.asyncLowPriority(std::chrono::hours(1), [&] { delayedRan = true; });
-  a->async([&] {
-    std::this_thread::sleep_for(20ms);
-    ++ran;
-    b->async([&] {
-      std::this_thread::sleep_for(20ms);
-      ++ran;
-    });
-  });
-  EXPECT_TRUE(pool.drain(10s));
-  EXPECT_EQ(ran.load(), 2);
-  pool.shutdown();
-  EXPECT_FALSE(delayedRan.load());
-}
-
-TEST(Shutdown, DropsLaterWorkAndOutlivingQueuesStaySafe) {
+// Throwing and empty closures, drain over cascaded work, and shutdown.
+TEST(Lifecycle, ThrowsDrainAndShutdown) {
   std::shared_ptr<SerialQueue> survivor;
   std::atomic<int> ran{0};
+  std::atomic<bool> delayedRan{false};
   {
     ThreadPoolDispatcher pool(small(2));
-    survivor = pool.makeSerialQueue("survivor", QoS::Default);
-    survivor->async([&] { ++ran; });
-    ASSERT_TRUE(pool.drain(10s));
+    survivor = pool.makeSerialQueue("a", QoS::Default);
+    auto b = pool.makeSerialQueue("b", QoS::Background);
+    pool.asyncLowPriority(std::chrono::hours(1), [&] { delayedRan = true; });
+    survivor->async([] { throw std::runtime_error("boom"); });
+    survivor->async([] { throw 42; });
+    survivor->async(Task{});  // an empty closure is ignored
+    pool.asyncLowPriority(0ns, [] { throw std::runtime_error("boom"); });
+    pool.asyncLowPriority(0ns, [&] { ++ran; });
+    survivor->async([&] {
+      std::this_thread::sleep_for(20ms);
+      ++ran;
+      b->async([&] {
+        std::this_thread::sleep_for(20ms);
+        ++ran;
+      });
+    });
+    EXPECT_TRUE(pool.drain(10s));  // waits for the cascade, not for the hour
+    EXPECT_EQ(ran.load(), 3);
     pool.shutdown();
     pool.shutdown();  // idempotent
     EXPECT_EQ(pool.workerCount(), 0u);
+    EXPECT_FALSE(delayedRan.load());
     survivor->async([&] { ++ran; });
     pool.asyncLowPriority(0ns, [&] { ++ran; });
     EXPECT_TRUE(pool.drain(10ms));
   }
   survivor->async([&] { ++ran; });  // the dispatcher is gone: ignored
-  EXPECT_EQ(ran.load(), 1);
+  EXPECT_EQ(ran.load(), 3);
 }
 
-TEST(Shutdown, ClosureSubmittedFromAClosureDuringShutdownIsDropped) {
+TEST(Lifecycle, ClosureSubmittedFromAClosureDuringShutdownIsDropped) {
   std::atomic<int> ran{0};
   auto pool = std::make_unique<ThreadPoolDispatcher>(small(1));
   auto q = pool->makeSerialQueue("self", QoS::Default);
   // A closure keeping its own queue alive must not leak when dropped.
-  std::promise<void> go;
+  std::promise<void> go, running;
   auto gate = go.get_future().share();
-  std::promise<void> running;
   q->async([q, gate, &ran, &running] {
     running.set_value();
     gate.wait_for(10s);

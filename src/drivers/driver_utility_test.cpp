@@ -32,14 +32,11 @@ Dictionary dict(std::initializer_list<std::pair<const char*, std::int64_t>> entr
 
 // ---- With the real statistics tree ----
 
-class TreeFixture : public ::testing::Test {
- protected:
-  TreeFixture() {
-    std::string pattern = (fs::temp_directory_path() / "vireo-drivers-XXXXXX").string();
-    if (::mkdtemp(pattern.data()) == nullptr) std::abort();
-    root_ = pattern;
-    stats_ = root_ / "stats";
-  }
+struct TreeFixture : ::testing::Test {
+  std::string pattern = (fs::temp_directory_path() / "vireo-drivers-XXXXXX").string();
+  fs::path root_ = ::mkdtemp(pattern.data()) ? pattern : std::string();
+  fs::path stats_ = root_ / "stats";
+  testing::RecordingLogger logger_;
   ~TreeFixture() override {
     std::error_code ec;
     fs::remove_all(root_, ec);
@@ -48,9 +45,6 @@ class TreeFixture : public ::testing::Test {
     fs::create_directories((stats_ / relative).parent_path());
     std::ofstream(stats_ / relative, std::ios::trunc) << text;
   }
-  fs::path root_;
-  fs::path stats_;
-  testing::RecordingLogger logger_;
 };
 
 TEST_F(TreeFixture, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
@@ -129,23 +123,19 @@ struct FakeChannel : DriverChannel {
   std::optional<std::string> name;
   std::int64_t value = 0;
 };
-
 struct FakeSamples : DriverSampleSet {
   std::vector<FakeChannel> channels;
   std::unique_ptr<DriverSampleSet> copy() const override { return std::make_unique<FakeSamples>(*this); }
 };
-
+// Sets and subscriptions carry the driver's description ("Speaker-(null)").
 struct FakeSubscribed : DriverSubscribedChannels {
   std::string driver;
   std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<FakeSubscribed>(*this); }
 };
-
 struct FakeChannelSet : DriverChannelSet {
   std::string driver;
-  std::int32_t count = 0;
 };
 
-// Keyed by the driver's description ("Speaker-(null)").
 struct DriverScript {
   std::int32_t channels = 1;
   std::optional<std::int64_t> copyError;
@@ -171,11 +161,10 @@ class ScriptedLibrary final : public DriverStatsLibrary {
     if (!it->second.returnsSet) return nullptr;
     auto set = std::make_unique<FakeChannelSet>();
     set->driver = key;
-    set->count = it->second.channels;
     return set;
   }
-  std::int32_t channelCount(const DriverChannelSet& channels) override {
-    return static_cast<const FakeChannelSet&>(channels).count;
+  std::int32_t channelCount(const DriverChannelSet& set) override {
+    return drivers[static_cast<const FakeChannelSet&>(set).driver].channels;
   }
   DriverSubscriptionHandle createSubscription(const DriverChannelSet& channels,
                                               std::unique_ptr<DriverSubscribedChannels>* subscribed) override {
@@ -186,51 +175,39 @@ class ScriptedLibrary final : public DriverStatsLibrary {
     *subscribed = std::move(s);
     return this;
   }
-  std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle handle,
-                                                 const DriverSubscribedChannels& subscribed,
+  std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle handle, const DriverSubscribedChannels& subscribed,
                                                  std::optional<DriverStatsError>* error) override {
     const auto* s = dynamic_cast<const FakeSubscribed*>(&subscribed);
     if (!handle || !s) {
       *error = DriverStatsError{22};
       return nullptr;
     }
-    const DriverScript& script = drivers[s->driver];
-    if (script.samplesError) {
-      *error = DriverStatsError{*script.samplesError};
-      return std::make_unique<FakeSamples>();  // an error wins even when a set comes back
-    }
     auto samples = std::make_unique<FakeSamples>();
-    samples->channels = script.values;
+    const DriverScript& script = drivers[s->driver];
+    if (script.samplesError) *error = DriverStatsError{*script.samplesError};  // an error wins even with a set
+    else samples->channels = script.values;
     return samples;
   }
   std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet* earlier, const DriverSampleSet& later,
                                                       std::optional<DriverStatsError>* error) override {
-    const auto& after = static_cast<const FakeSamples&>(later);
     deltaEarlier.push_back(earlier ? "set" : "none");
     if (deltaError) {
       *error = DriverStatsError{*deltaError};
       return nullptr;
     }
-    auto delta = std::make_unique<FakeSamples>(after);
-    if (earlier) {
-      const auto& before = static_cast<const FakeSamples&>(*earlier);
-      for (std::size_t i = 0; i < delta->channels.size() && i < before.channels.size(); ++i)
-        delta->channels[i].value -= before.channels[i].value;
+    auto delta = std::make_unique<FakeSamples>(static_cast<const FakeSamples&>(later));
+    for (std::size_t i = 0; earlier && i < delta->channels.size(); ++i) {
+      const auto& before = static_cast<const FakeSamples&>(*earlier).channels;
+      if (i < before.size()) delta->channels[i].value -= before[i].value;
     }
     return delta;
   }
-  void iterate(const DriverSampleSet& samples,
-               const std::function<DriverIterate(const DriverChannel&)>& visitor) override {
-    for (const auto& c : static_cast<const FakeSamples&>(samples).channels) {
+  void iterate(const DriverSampleSet& samples, const std::function<DriverIterate(const DriverChannel&)>& visitor) override {
+    for (const auto& c : static_cast<const FakeSamples&>(samples).channels)
       if (visitor(c) == DriverIterate::Stop) break;
-    }
   }
-  std::optional<std::string> channelName(const DriverChannel& channel) override {
-    return static_cast<const FakeChannel&>(channel).name;
-  }
-  std::int64_t simpleIntegerValue(const DriverChannel& channel) override {
-    return static_cast<const FakeChannel&>(channel).value;
-  }
+  std::optional<std::string> channelName(const DriverChannel& c) override { return static_cast<const FakeChannel&>(c).name; }
+  std::int64_t simpleIntegerValue(const DriverChannel& c) override { return static_cast<const FakeChannel&>(c).value; }
 };
 
 FakeChannel channel(std::optional<std::string> name, std::int64_t value) {
@@ -240,30 +217,43 @@ FakeChannel channel(std::optional<std::string> name, std::int64_t value) {
   return c;
 }
 
-TEST(DriverUtilityFailures, CopyErrorIsLoggedAndAReturnedSetIsStillSubscribed) {
+TEST(DriverUtilityFailures, CopyAndSubscriptionErrors) {
   ScriptedLibrary library;
   library.drivers["OrvaneTK4HB-(null)"].channels = 2;
-  library.drivers["OrvaneTK4HB-(null)"].copyError = 5;
+  library.drivers["OrvaneTK4HB-(null)"].copyError = 5;  // logged, but the returned set is still subscribed
   library.drivers["Speaker-(null)"].copyError = 6;
   library.drivers["Speaker-(null)"].returnsSet = false;
   library.drivers["(null)-MCA"].channels = 0;
+  library.drivers["Haptics-Stats"].subscriptionFails = true;  // shows up as a sampling error
+  library.drivers["Haptics-Stats"].values = {channel("x", 4)};
   testing::RecordingLogger logger;
   VRReportingDriverUtility utility(library, logger);
 
-  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 1u);
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 2u);
   EXPECT_EQ(utility.ioChannelSubscriptions()[0]->driver()->description(), "OrvaneTK4HB-(null)");
+  EXPECT_EQ(utility.ioChannelSubscriptions()[1]->subscription, nullptr);
   EXPECT_THAT(messages(logger), ElementsAre("creating hwreporting driver utility",
                                              "error 5 getting channels for driver OrvaneTK4HB-(null)",
                                              "subscribed to group group OrvaneTK4HB-(null)",
                                              "error 6 getting channels for driver Speaker-(null)",
                                              "couldn't find any channels for driver group (null)-MCA",
-                                             "subscribed to group group (null)-MCA"));
+                                             "subscribed to group group (null)-MCA",
+                                             "subscribed to group group Haptics-Stats"));
   EXPECT_EQ(logger.entries()[1].level, LogLevel::Error);
+  logger.clear();
+
+  auto snapshot = utility.getSnapShot();
+  ASSERT_EQ(snapshot->samples.size(), 1u);
+  EXPECT_EQ(snapshot->samples[0].first, "OrvaneTK4HB-(null)");
+  EXPECT_THAT(messages(logger), ElementsAre("sampling driver OrvaneTK4HB-(null)", "sampling driver Haptics-Stats",
+                                             "HWReportCreateSamples error 22"));
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), std::nullopt);
 }
 
-TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriver) {
+TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriverAndDeltaErrorFallsBackToAbsolutes) {
   ScriptedLibrary library;
-  library.drivers["Speaker-(null)"].values = {channel("x", 4)};
+  library.drivers["Speaker-(null)"].values = {channel("x", 4), channel(std::nullopt, 3), channel("z", 0)};
+  library.drivers["(null)-MCA"].values = {channel("m", 1)};
   library.drivers["Haptics-Stats"].samplesError = 7;
   library.drivers["Haptics-Stats"].values = {channel("y", 9)};
   testing::RecordingLogger logger;
@@ -271,58 +261,35 @@ TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriver) {
   logger.clear();
 
   auto snapshot = utility.getSnapShot();
-  ASSERT_EQ(snapshot->samples.size(), 1u);
-  EXPECT_EQ(snapshot->samples[0].first, "Speaker-(null)");
-  EXPECT_THAT(messages(logger), ElementsAre("sampling driver Speaker-(null)", "sampling driver Haptics-Stats",
-                                             "HWReportCreateSamples error 7"));
-  EXPECT_EQ(logger.entries()[2].level, LogLevel::Error);
-  EXPECT_EQ(logger.entries()[2].function, "-[VRReportingDriverUtility getSnapShot]");
+  ASSERT_EQ(snapshot->samples.size(), 2u);
+  EXPECT_THAT(messages(logger), ElementsAre("sampling driver Speaker-(null)", "sampling driver (null)-MCA",
+                                             "sampling driver Haptics-Stats", "HWReportCreateSamples error 7"));
+  EXPECT_EQ(logger.entries()[3].level, LogLevel::Error);
+  EXPECT_EQ(logger.entries()[3].function, "-[VRReportingDriverUtility getSnapShot]");
 
   logger.clear();
-  library.drivers["Speaker-(null)"].values = {channel("x", 6)};
+  library.drivers["Speaker-(null)"].values[0] = channel("x", 6);
   auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
   EXPECT_EQ(*delta, dict({{"Speaker_x", 2}}));
   EXPECT_THAT(messages(logger), ElementsAre("getting latest samples", "done getting latest samples",
                                              "getting latest samples", "done getting latest samples",
+                                             "getting latest samples", "done getting latest samples",
                                              "HWReportCreateSamples error 7"));
   for (const auto& line : logger.entries())
     EXPECT_EQ(line.function, "-[VRReportingDriverUtility getDriverStatisticsRelativeToSnapShot:]");
-}
 
-TEST(DriverUtilityFailures, DeltaErrorFallsBackToAbsoluteValues) {
-  ScriptedLibrary library;
-  library.drivers["Speaker-(null)"].values = {channel("x", 4), channel(std::nullopt, 3), channel("z", 0)};
-  library.drivers["(null)-MCA"].values = {channel("m", 1)};
-  testing::RecordingLogger logger;
-  VRReportingDriverUtility utility(library, logger);
-  auto snapshot = utility.getSnapShot();
   snapshot->samples.pop_back();  // MCA lacks its entry: passed on as no earlier set
   library.deltaError = 9;
+  library.deltaEarlier.clear();
   logger.clear();
-
-  auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
+  delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
   // A nameless channel leaves the key ending in "_".
-  EXPECT_EQ(*delta, dict({{"Speaker_x", 4}, {"Speaker_", 3}, {"MCA_m", 1}}));
+  EXPECT_EQ(*delta, dict({{"Speaker_x", 6}, {"Speaker_", 3}, {"MCA_m", 1}}));
   EXPECT_THAT(library.deltaEarlier, ElementsAre("set", "none"));
   EXPECT_EQ(messages(logger)[2], "HWReportCreateSamplesDelta error 9");
   EXPECT_EQ(logger.entries()[2].level, LogLevel::Error);
-}
-
-TEST(DriverUtilityFailures, FailedSubscriptionShowsUpAsSamplingError) {
-  ScriptedLibrary library;
-  library.drivers["Speaker-(null)"].subscriptionFails = true;
-  library.drivers["Speaker-(null)"].values = {channel("x", 4)};
-  testing::RecordingLogger logger;
-  VRReportingDriverUtility utility(library, logger);
-  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 1u);
-  EXPECT_EQ(utility.ioChannelSubscriptions()[0]->subscription, nullptr);
-  logger.clear();
-
-  EXPECT_TRUE(utility.getSnapShot()->samples.empty());
-  EXPECT_THAT(messages(logger), ElementsAre("sampling driver Speaker-(null)", "HWReportCreateSamples error 22"));
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), std::nullopt);
 }
 
 }  // namespace

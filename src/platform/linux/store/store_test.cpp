@@ -1,29 +1,83 @@
-#include "platform/linux/store/store.h"
-
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sqlite3.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <future>
 #include <thread>
 
-#include "platform/linux/store/store_test_support.h"
+#include "platform/linux/store/analytics_service.h"
+#include "platform/linux/store/energy_log_service.h"
+#include "platform/linux/store/store.h"
+#include "platform/linux/store/telemetry_service.h"
+#include "fakes/fake_platform.h"
 #include "platform/linux/system_clock.h"
 
 namespace vireo::linux_platform {
 namespace {
 
 using namespace std::chrono_literals;
-using testing::Reader;
-using testing::RecordingLogger;
-using testing::TempDir;
+using Backends = std::optional<std::vector<std::string>>;
+using Row = std::vector<std::optional<std::string>>;
+
+struct TempDir {
+  std::string pattern = (std::filesystem::temp_directory_path() / "vireo-store-XXXXXX").string();
+  std::string dir = ::mkdtemp(pattern.data()) ? pattern : std::string();
+  ~TempDir() {
+    std::error_code ignored;
+    std::filesystem::remove_all(dir, ignored);
+  }
+  const std::string& path() const { return dir; }
+  std::string sub(const std::string& name) const { return dir + "/" + name; }
+  void write(const std::string& name, const std::string& text) const { std::ofstream(sub(name)) << text; }
+};
+
+// An independent reader of the store's file, as another process would see it.
+class Reader {
+ public:
+  explicit Reader(const std::string& path) { sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE, nullptr); }
+  ~Reader() { sqlite3_close(db_); }
+  Reader(const Reader&) = delete;
+  Reader& operator=(const Reader&) = delete;
+  std::vector<Row> query(const std::string& sql) const {
+    std::vector<Row> rows;
+    sqlite3_stmt* s = nullptr;
+    if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &s, nullptr) != SQLITE_OK) return rows;
+    while (sqlite3_step(s) == SQLITE_ROW) {
+      Row& row = rows.emplace_back();
+      for (int i = 0; i < sqlite3_column_count(s); ++i) {
+        const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(s, i));
+        row.push_back(text ? std::optional<std::string>(text) : std::nullopt);
+      }
+    }
+    sqlite3_finalize(s);
+    return rows;
+  }
+  // The first column of the first row, "" when there is none or it is NULL.
+  std::string scalar(const std::string& sql) const {
+    auto rows = query(sql);
+    return rows.empty() || rows[0].empty() || !rows[0][0] ? std::string() : *rows[0][0];
+  }
+  bool exec(const std::string& sql) const { return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr) == SQLITE_OK; }
+
+ private:
+  sqlite3* db_ = nullptr;
+};
 
 struct StoreTest : ::testing::Test {
   TempDir dir;
   SystemClock clock;
-  RecordingLogger logger;
+  testing::RecordingLogger logger;
+  std::size_t errors() const {
+    auto entries = logger.entries();
+    return std::count_if(entries.begin(), entries.end(), [](const auto& e) { return e.level == LogLevel::Error; });
+  }
   std::string state() const { return dir.sub("state/nested"); }
   std::string db() const { return state() + "/vireo.db"; }
 };
@@ -58,45 +112,6 @@ TEST_F(StoreTest, CreatesTheContractSchemaInWalMode) {
   EXPECT_EQ(reader.scalar("PRAGMA journal_mode"), "wal");
 }
 
-TEST_F(StoreTest, FlushMakesEveryKindOfRowVisibleWithJsonInInsertionOrder) {
-  LocalStore store(state(), logger, clock);
-  Dictionary info{{"client_type", 19}, {"session_id", -1}, {"batch_event", true}};
-  Dictionary user{{"service_name", "x"}, {"client_name", "com.orvane.vireo"}};
-  Dictionary payload{{"zeta", 1}, {"alpha", "a"}, {"mid", Dictionary{{"k", 2.5}}}};
-  auto id = store.insertTelemetrySession(info, user, 100.5);
-  ASSERT_TRUE(id);
-  EXPECT_TRUE(store.insertTelemetryMessage(*id, nullptr, nullptr, 8, 4, payload, 101.0));
-  EXPECT_TRUE(store.insertTelemetryMessage(std::nullopt, &info, &user, 3, 1, payload, 102.0));
-  EXPECT_TRUE(store.setBackends(*id, std::vector<std::string>{"local", "remote"}));
-  EXPECT_TRUE(store.setFlushed(*id, 103.0));
-  EXPECT_TRUE(store.insertAnalyticsEvent("com.orvane.vireo.Error.Error", payload, 104.0));
-  EXPECT_TRUE(store.insertEnergyEvent(28, "Lumen_Haptics", payload, 105.0));
-  ASSERT_TRUE(store.flush(5s));
-
-  Reader reader(db());
-  auto s = reader.query("SELECT id, json_type(session_info), json_type(user_info), backends, created_at, flushed_at "
-                        "FROM telemetry_sessions");
-  ASSERT_EQ(s.size(), 1u);
-  EXPECT_EQ(s[0], (testing::Row{std::to_string(*id), "object", "object", R"(["local","remote"])", "100.5", "103.0"}));
-  EXPECT_EQ(reader.scalar("SELECT group_concat(key) FROM telemetry_sessions, json_each(user_info)"),
-            "service_name,client_name");
-  auto m = reader.query("SELECT session, session_info IS NULL, json_type(user_info), category, type, sent_at "
-                        "FROM telemetry_messages ORDER BY id");
-  ASSERT_EQ(m.size(), 2u);
-  EXPECT_EQ(m[0], (testing::Row{std::to_string(*id), "1", std::nullopt, "8", "4", "101.0"}));
-  EXPECT_EQ(m[1], (testing::Row{std::nullopt, "0", "object", "3", "1", "102.0"}));
-  for (const char* table : {"telemetry_messages", "analytics_events", "energy_events"}) {
-    EXPECT_EQ(reader.scalar(std::string("SELECT group_concat(key) FROM (SELECT key FROM ") + table +
-                            ", json_each(payload) ORDER BY " + table + ".id LIMIT 3)"),
-              "zeta,alpha,mid")
-        << table;
-  }
-  EXPECT_EQ(reader.scalar("SELECT json_extract(payload, '$.mid.k') FROM analytics_events"), "2.5");
-  EXPECT_EQ(reader.scalar("SELECT name || '@' || at FROM analytics_events"), "com.orvane.vireo.Error.Error@104.0");
-  EXPECT_EQ(reader.scalar("SELECT client || name || at FROM energy_events"), "28Lumen_Haptics105.0");
-  EXPECT_TRUE(logger.errors().empty());
-}
-
 TEST_F(StoreTest, RowsBecomeVisibleWithinASecondWithoutFlush) {
   LocalStore store(state(), logger, clock);
   Reader reader(db());
@@ -107,22 +122,6 @@ TEST_F(StoreTest, RowsBecomeVisibleWithinASecondWithoutFlush) {
     std::this_thread::sleep_for(10ms);
   }
   EXPECT_EQ(reader.scalar("SELECT COUNT(*) FROM analytics_events"), "1");
-}
-
-TEST_F(StoreTest, CloseCommitsAndSessionIdsContinueAfterReopen) {
-  {
-    LocalStore store(state(), logger, clock);
-    EXPECT_EQ(store.insertTelemetrySession(Dictionary{}, Dictionary{}, 1.0), std::optional<std::int64_t>(1));
-    EXPECT_EQ(store.insertTelemetrySession(Dictionary{}, Dictionary{}, 1.0), std::optional<std::int64_t>(2));
-    store.close();
-    EXPECT_FALSE(store.usable());
-    EXPECT_FALSE(store.insertAnalyticsEvent("late", Dictionary{}, 1.0));
-    store.close();
-  }
-  LocalStore again(state(), logger, clock);
-  EXPECT_EQ(again.insertTelemetrySession(Dictionary{}, Dictionary{}, 1.0), std::optional<std::int64_t>(3));
-  again.close();
-  EXPECT_EQ(Reader(db()).scalar("SELECT group_concat(id) FROM telemetry_sessions"), "1,2,3");
 }
 
 // Another process holding the write lock stands in for a failing disk.
@@ -136,7 +135,7 @@ TEST_F(StoreTest, FailedBatchIsDroppedAfterRetryAndWritingGoesOn) {
   ASSERT_TRUE(blocker.exec("BEGIN IMMEDIATE"));
   ASSERT_TRUE(store.insertAnalyticsEvent("lost", Dictionary{}, 1.0));
   EXPECT_FALSE(store.flush(5s));
-  EXPECT_GE(logger.errors().size(), 2u);
+  EXPECT_GE(errors(), 2u);
 
   // While the writer is stuck, the bounded queue refuses rows instead of growing.
   ASSERT_TRUE(store.insertAnalyticsEvent("stuck", Dictionary{}, 1.0));
@@ -153,12 +152,13 @@ TEST_F(StoreTest, FailedBatchIsDroppedAfterRetryAndWritingGoesOn) {
   EXPECT_EQ(blocker.scalar("SELECT COUNT(*) FROM analytics_events WHERE name='kept'"), "1");
 }
 
-TEST_F(StoreTest, FlushedRowsSurviveSigkill) {
+TEST_F(StoreTest, FlushedRowsSurviveSigkillAndIdsContinue) {
   constexpr int kFlushed = 300;
   pid_t child = ::fork();
   ASSERT_GE(child, 0);
   if (child == 0) {
     LocalStore store(state(), logger, clock);
+    store.insertTelemetrySession(Dictionary{}, Dictionary{}, 1.0);
     for (int i = 0; i < kFlushed; ++i)
       store.insertTelemetryMessage(std::nullopt, nullptr, nullptr, 1, 2, Dictionary{{"i", i}}, 1.0);
     if (!store.flush(10s)) ::_exit(3);
@@ -173,6 +173,8 @@ TEST_F(StoreTest, FlushedRowsSurviveSigkill) {
 
   LocalStore reopened(state(), logger, clock);
   ASSERT_TRUE(reopened.usable());
+  // Session ids go on after the last one on disk.
+  EXPECT_EQ(reopened.insertTelemetrySession(Dictionary{}, Dictionary{}, 1.0), std::optional<std::int64_t>(2));
   Reader reader(db());
   EXPECT_EQ(reader.scalar("PRAGMA integrity_check"), "ok");
   EXPECT_EQ(reader.scalar("SELECT COUNT(*) FROM telemetry_messages WHERE json_extract(payload, '$.i') < " +
@@ -180,6 +182,158 @@ TEST_F(StoreTest, FlushedRowsSurviveSigkill) {
             std::to_string(kFlushed));
   // Whatever else made it is a prefix, never a torn batch.
   EXPECT_EQ(reader.scalar("SELECT MAX(json_extract(payload, '$.i')) + 1 = COUNT(*) FROM telemetry_messages"), "1");
+}
+
+struct ServicesTest : StoreTest {
+  std::shared_ptr<LocalStore> store = std::make_shared<LocalStore>(state(), logger, clock);
+};
+
+struct Configured {
+  Backends backends;
+  std::thread::id thread;
+};
+
+Configured configure(TelemetrySession& session) {
+  std::promise<Configured> answer;
+  session.startConfiguration([&](Backends backends) {
+    answer.set_value(Configured{std::move(backends), std::this_thread::get_id()});
+  });
+  auto future = answer.get_future();
+  EXPECT_EQ(future.wait_for(5s), std::future_status::ready);
+  return future.get();
+}
+
+std::optional<Error> flush(TelemetrySession& session) {
+  std::promise<std::optional<Error>> answer;
+  session.flushMessages([&](std::optional<Error> error) { answer.set_value(std::move(error)); });
+  auto future = answer.get_future();
+  EXPECT_EQ(future.wait_for(15s), std::future_status::ready);
+  return future.get();
+}
+
+TEST_F(ServicesTest, SessionRowAndMessagesAreVisibleOnceTheFlushAnswers) {
+  LocalTelemetryService service(store, dir.path());
+  Dictionary info{{"client_type", 19}, {"client_version", 2.0}, {"session_id", 7}, {"batch_event", true},
+                  {"hierarchy_token", service.makeHierarchyToken()->text}};
+  Dictionary user{{"client_name", "com.orvane.vireo"}, {"service_name", "telephony_session"}, {"Host", "x"}};
+  auto session = service.createSession(info, user, {});
+  auto* local = dynamic_cast<LocalTelemetrySession*>(session.get());
+  ASSERT_TRUE(local && local->rowId());
+  const std::string id = std::to_string(*local->rowId());
+
+  std::optional<Error> error;
+  EXPECT_TRUE(session->sendMessage(8, 4, Dictionary{{"a_b", 1}}, &error));
+  EXPECT_TRUE(session->sendMessage(3, 1, Dictionary{{"n", "v"}}, &error));
+  EXPECT_FALSE(error);
+  EXPECT_EQ(flush(*session), std::nullopt);
+
+  // Visible as soon as the flush has answered, without another flush.
+  Reader reader(db());
+  EXPECT_EQ(reader.scalar("SELECT group_concat(key) FROM telemetry_sessions, json_each(session_info)"),
+            "client_type,client_version,session_id,batch_event,hierarchy_token");
+  EXPECT_EQ(reader.scalar("SELECT group_concat(key) FROM telemetry_sessions, json_each(user_info)"),
+            "client_name,service_name,Host");
+  EXPECT_EQ(reader.scalar("SELECT group_concat(session || ':' || category || ':' || type || ':' || payload, ' ') "
+                          "FROM telemetry_messages WHERE session_info IS NULL AND user_info IS NULL"),
+            id + ":8:4:{\"a_b\":1} " + id + ":3:1:{\"n\":\"v\"}");
+}
+
+TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {
+  auto service = std::make_unique<LocalTelemetryService>(store, dir.path());
+  struct Case {
+    const char* file;  // nullptr: no telemetry.conf
+    Backends answer;
+    std::optional<std::string> column;
+  };
+  const Case cases[] = {
+      {nullptr, std::vector<std::string>{"local"}, R"(["local"])"},
+      {"# nothing here\nOther=1\n", std::vector<std::string>{"local"}, R"(["local"])"},
+      {"Backends=none\n", std::nullopt, std::nullopt},
+      {"Backends=\n", std::vector<std::string>{}, "[]"},
+      {"Backends = local , remote\n", std::vector<std::string>{"local", "remote"}, R"(["local","remote"])"},
+  };
+  std::optional<std::thread::id> serviceThread;
+  Reader reader(db());
+  for (const auto& c : cases) {
+    std::filesystem::remove(dir.sub("telemetry.conf"));
+    if (c.file) dir.write("telemetry.conf", c.file);
+    auto session = service->createSession(Dictionary{}, Dictionary{}, {});
+    auto configured = configure(*session);
+    EXPECT_EQ(configured.backends, c.answer) << (c.file ? c.file : "no file");
+    // One long-lived thread of the service's own answers every call.
+    EXPECT_NE(configured.thread, std::this_thread::get_id());
+    EXPECT_EQ(configured.thread, serviceThread.value_or(configured.thread));
+    serviceThread = configured.thread;
+    ASSERT_TRUE(store->flush(5s));
+    auto id = std::to_string(*dynamic_cast<LocalTelemetrySession&>(*session).rowId());
+    auto rows = reader.query("SELECT backends FROM telemetry_sessions WHERE id = " + id);
+    ASSERT_EQ(rows.size(), 1u);
+    EXPECT_EQ(rows[0][0], c.column) << (c.file ? c.file : "no file");
+  }
+
+  // A session keeps working after its service is gone.
+  std::filesystem::remove(dir.sub("telemetry.conf"));
+  auto orphan = service->createSession(Dictionary{}, Dictionary{}, {});
+  service.reset();
+  EXPECT_EQ(configure(*orphan).backends, Backends(std::vector<std::string>{"local"}));
+  EXPECT_EQ(flush(*orphan), std::nullopt);
+}
+
+TEST_F(ServicesTest, AnalyticsExcludedEventsNeverBuildTheirPayload) {
+  dir.write("analytics.conf", "Exclude = com.orvane.vireo.Error.*, *.Debug\n");
+  LocalAnalyticsService analytics(store, dir.path());
+  int calls = 0;
+  auto payload = [&] {
+    ++calls;
+    return Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"k", 1}};
+  };
+  analytics.sendEventLazy("com.orvane.vireo.Error.Error", payload);
+  analytics.sendEventLazy("com.orvane.vireo.Routing_Playback.Debug", payload);
+  analytics.sendEventLazy("com.orvane.vireo.Routing_Playback.Start", payload);
+  EXPECT_EQ(calls, 1);
+
+  dir.write("analytics.conf", "Exclude=\n");
+  analytics.reload();
+  analytics.sendEventLazy("com.orvane.vireo.Error.Error", payload);
+  EXPECT_EQ(calls, 2);
+
+  LocalEnergyLogService energy(store);
+  energy.logEvent(28, "Lumen_Haptics", Dictionary{{"EngineOnDuration", 1.5}, {"ApplicationName", "Unknown"}});
+
+  ASSERT_TRUE(store->flush(5s));
+  Reader reader(db());
+  EXPECT_EQ(reader.scalar("SELECT group_concat(name || '=' || payload, ' ') FROM analytics_events"),
+            R"(com.orvane.vireo.Routing_Playback.Start={"HostApplicationDisplayID":"Unknown","k":1} )"
+            R"(com.orvane.vireo.Error.Error={"HostApplicationDisplayID":"Unknown","k":1})");
+  EXPECT_EQ(reader.scalar("SELECT client || ' ' || name || ' ' || payload FROM energy_events"),
+            R"(28 Lumen_Haptics {"EngineOnDuration":1.5,"ApplicationName":"Unknown"})");
+}
+
+TEST_F(ServicesTest, UnwritableStateDirectoryMakesSendsFailWithoutCrashing) {
+  dir.write("plain-file", "not a directory");
+  auto broken = std::make_shared<LocalStore>(dir.sub("plain-file/state"), logger, clock);
+  EXPECT_FALSE(broken->usable());
+  EXPECT_GE(errors(), 1u);
+
+  LocalTelemetryService service(broken, dir.path());
+  auto session = service.createSession(Dictionary{}, Dictionary{}, {});
+  std::optional<Error> error;
+  EXPECT_FALSE(session->sendMessage(1, 2, Dictionary{}, &error));
+  ASSERT_TRUE(error);
+  error.reset();
+  EXPECT_FALSE(service.sendOneMessage(Dictionary{}, Dictionary{}, 1, 2, Dictionary{}, &error));
+  EXPECT_TRUE(error);
+  EXPECT_TRUE(flush(*session).has_value());
+  EXPECT_EQ(configure(*session).backends, Backends(std::vector<std::string>{"local"}));
+
+  int calls = 0;
+  LocalAnalyticsService(broken, dir.path()).sendEventLazy("e", [&] {
+    ++calls;
+    return Dictionary{};
+  });
+  LocalEnergyLogService(broken).logEvent(28, "Lumen_Haptics", Dictionary{});
+  EXPECT_EQ(calls, 1);
+  EXPECT_FALSE(broken->flush(1s));
 }
 
 }  // namespace
