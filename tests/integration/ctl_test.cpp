@@ -2,7 +2,6 @@
 // the defaults suite with its notification, and the store queries.
 #include <unistd.h>
 
-#include <fstream>
 #include <sstream>
 
 #include "service_fixture.h"
@@ -19,8 +18,8 @@ struct CtlRun {
 class CtlTest : public ServiceTest {
  protected:
   CtlRun ctl(std::vector<std::string> args, const std::string& input = "") {
-    std::string inputFile = dir_->path() + "/ctl-input";
-    std::string errFile = dir_->path() + "/ctl-stderr";
+    std::string inputFile = dir_ + "/ctl-input";
+    std::string errFile = dir_ + "/ctl-stderr";
     writeFile(inputFile, input);
     ::unlink(errFile.c_str());
     std::vector<std::string> argv{"/bin/sh", "-c", "exec \"$0\" \"$@\" < " + inputFile, VIREOCTL_PATH};
@@ -38,10 +37,7 @@ class CtlTest : public ServiceTest {
     while ((n = ::read(fd, buf, sizeof buf)) > 0) run.out.append(buf, static_cast<size_t>(n));
     ::close(fd);
     run.status = p.waitExit(30s).value_or(-1);
-    std::ifstream in(errFile);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    run.text = ss.str();
+    run.text = readFile(errFile);
     return run;
   }
   static std::vector<nlohmann::json> jsonLines(const std::string& out) {
@@ -52,7 +48,8 @@ class CtlTest : public ServiceTest {
   }
 };
 
-TEST_F(CtlTest, SequenceRunsOnOneConnection) {
+TEST_F(CtlTest, SequencesScriptsStoreQueriesAndTheReportingSwitch) {
+  // A sequence runs on one connection, so the start is answered by the stop.
   auto r = ctl({"--json", "create", "5", "--", "set-service-type", "5", "2", "--", "service-type", "5", "--", "start",
                 "5", "--", "send", "--to", "5", "0x40000003", "1", "buffer size=512", "--", "list", "--", "stop", "5",
                 "--", "valid", "5"});
@@ -66,34 +63,17 @@ TEST_F(CtlTest, SequenceRunsOnOneConnection) {
   for (const auto& l : lines) answered = answered || (l.contains("answered") && l["answered"] == true);
   EXPECT_TRUE(answered) << r.out;
   EXPECT_EQ(lines.back()["serviceType"], 2);
-}
 
-TEST_F(CtlTest, ScriptModeAndExitCodes) {
-  auto r = ctl({"-"}, "create 9  # first\nstart 9\nsleep 0.1\nstop 9\nwait-start 9 5\nlist\n");
+  r = ctl({"-"}, "create 9  # first\nstart 9\nsleep 0.1\nstop 9\nwait-start 9 5\nlist\n");
   EXPECT_EQ(r.status, 0) << r.text;
   EXPECT_NE(r.out.find("start 9: answered true"), std::string::npos) << r.out;
   EXPECT_NE(r.out.find("list: 9"), std::string::npos) << r.out;
-
   EXPECT_EQ(ctl({"create"}).status, 2);
   EXPECT_EQ(ctl({"send", "0x1ffffffff", "1"}).status, 2);
   EXPECT_EQ(ctl({"script"}, "create 1\nbogus\n").status, 2);
   EXPECT_EQ(ctl({"wait-start", "3", "0.1"}).status, 1);
-}
 
-TEST_F(CtlTest, DefaultsAndNotificationSwitchReportingOff) {
-  ASSERT_EQ(ctl({"defaults", "write", "disable_reporting", "true"}).status, 0);
-  EXPECT_EQ(ctl({"defaults", "read", "disable_reporting"}).out, "true\n");
-  ASSERT_EQ(ctl({"notify", "com.orvane.vireo.reporting"}).status, 0);
-  CtlRun r;
-  EXPECT_TRUE(eventually([&] { return (r = ctl({"send", "3", "1", "k=1"})).status == 1; }));
-  EXPECT_NE(r.text.find("com.orvane.audio.reporting.ReportingDisabled"), std::string::npos) << r.text;
-
-  ASSERT_EQ(ctl({"defaults", "delete", "disable_reporting"}).status, 0);
-  ASSERT_EQ(ctl({"notify"}).status, 0);
-  EXPECT_TRUE(eventually([&] { return ctl({"send", "3", "1", "k=1"}).status == 0; }));
-}
-
-TEST_F(CtlTest, StoreQueriesEmbedJson) {
+  // Store queries embed the JSON columns.
   ASSERT_EQ(ctl({"create", "4", "--", "start", "4", "--", "send", "--to", "4", "0x08000002", "3", "n=7", "x=1.5",
                  "--", "stop", "4"})
                 .status,
@@ -101,8 +81,8 @@ TEST_F(CtlTest, StoreQueriesEmbedJson) {
   nlohmann::json rowsJson;
   ASSERT_TRUE(eventually(
       [&] {
-        auto r = ctl({"messages", "--json", "--since", "2000-01-01T00:00:00Z"});
-        rowsJson = nlohmann::json::parse(r.out, nullptr, false);
+        rowsJson = nlohmann::json::parse(ctl({"messages", "--json", "--since", "2000-01-01T00:00:00Z"}).out, nullptr,
+                                         false);
         for (const auto& row : rowsJson)
           if (row["category"] == 2) return true;
         return false;
@@ -118,6 +98,16 @@ TEST_F(CtlTest, StoreQueriesEmbedJson) {
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_TRUE(sessions[0]["user_info"].is_object());
   EXPECT_EQ(ctl({"analytics", "--session", "1"}).status, 2);
+
+  // The defaults suite with its notification switches reporting off and on.
+  ASSERT_EQ(ctl({"defaults", "write", "disable_reporting", "true"}).status, 0);
+  EXPECT_EQ(ctl({"defaults", "read", "disable_reporting"}).out, "true\n");
+  ASSERT_EQ(ctl({"notify", "com.orvane.vireo.reporting"}).status, 0);
+  EXPECT_TRUE(eventually([&] { return (r = ctl({"send", "3", "1", "k=1"})).status == 1; }));
+  EXPECT_NE(r.text.find("com.orvane.audio.reporting.ReportingDisabled"), std::string::npos) << r.text;
+  ASSERT_EQ(ctl({"defaults", "delete", "disable_reporting"}).status, 0);
+  ASSERT_EQ(ctl({"notify"}).status, 0);
+  EXPECT_TRUE(eventually([&] { return ctl({"send", "3", "1", "k=1"}).status == 0; }));
 }
 
 }  // namespace

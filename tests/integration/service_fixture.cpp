@@ -18,16 +18,6 @@ namespace vireo::itest {
 
 namespace fs = std::filesystem;
 
-TempDir::TempDir() {
-  char tmpl[] = "/tmp/vireo-itest-XXXXXX";
-  if (mkdtemp(tmpl)) path_ = tmpl;
-}
-
-TempDir::~TempDir() {
-  std::error_code ec;
-  if (!path_.empty() && !std::getenv("VIREO_KEEP_TEST_DIRS")) fs::remove_all(path_, ec);
-}
-
 ChildProcess::~ChildProcess() { stop(); }
 
 bool ChildProcess::start(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
@@ -124,34 +114,29 @@ std::string startBus(ChildProcess& bus, const std::string& dir) {
 }  // namespace
 
 void ServiceTest::SetUp() {
-  dir_ = std::make_unique<TempDir>();
-  ASSERT_FALSE(dir_->path().empty());
-  configDir_ = dir_->path() + "/conf";
-  stateDir_ = dir_->path() + "/state";
-  logsDir_ = dir_->path() + "/logs";
-  runtimeDir_ = dir_->path() + "/run";
+  char tmpl[] = "/tmp/vireo-itest-XXXXXX";
+  ASSERT_TRUE(mkdtemp(tmpl));
+  dir_ = tmpl;
+  configDir_ = dir_ + "/conf";
+  stateDir_ = dir_ + "/state";
+  logsDir_ = dir_ + "/logs";
+  runtimeDir_ = dir_ + "/run";
   for (const auto& d : {configDir_, stateDir_, logsDir_, runtimeDir_}) fs::create_directories(d);
-  daemonLog_ = dir_->path() + "/vireo-reportingd.log";
-  busAddress_ = startBus(bus_, dir_->path());
+  daemonLog_ = dir_ + "/vireo-reportingd.log";
+  busAddress_ = startBus(bus_, dir_);
   ASSERT_FALSE(busAddress_.empty()) << "dbus-daemon did not start";
   for (const auto& [name, text] : configurationFiles()) writeFile(configDir_ + "/" + name, text);
   prepareRuntimeDirectory(runtimeDir_);
-  startDaemon();
-}
-
-void ServiceTest::startDaemon() {
-  std::map<std::string, std::string> env{
-      {"CONFIGURATION_DIRECTORY", configDir_},
-      {"STATE_DIRECTORY", stateDir_},
-      {"LOGS_DIRECTORY", logsDir_},
-      {"RUNTIME_DIRECTORY", runtimeDir_},
-      {"VIREO_BUS", "session"},
-      {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
-      {"DBUS_STARTER_BUS_TYPE", ""},
-      {"JOURNAL_STREAM", ""},
-  };
-  for (const auto& [k, v] : extraEnv_) env[k] = v;
-  ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH}, env, daemonLog_));
+  ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH},
+                            {{"CONFIGURATION_DIRECTORY", configDir_},
+                             {"STATE_DIRECTORY", stateDir_},
+                             {"LOGS_DIRECTORY", logsDir_},
+                             {"RUNTIME_DIRECTORY", runtimeDir_},
+                             {"VIREO_BUS", "session"},
+                             {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
+                             {"DBUS_STARTER_BUS_TYPE", ""},
+                             {"JOURNAL_STREAM", ""}},
+                            daemonLog_));
   auto probe = client::Client::connectAddress(busAddress_);
   ASSERT_TRUE(probe) << probe.error().message;
   bool up = eventually([&] { return bool((*probe)->ping()) || !daemon_.running(); }, 20s);
@@ -159,11 +144,12 @@ void ServiceTest::startDaemon() {
 }
 
 void ServiceTest::TearDown() {
-  if (!dir_) return;
+  if (dir_.empty()) return;
   daemon_.stop();
   if (HasFailure()) std::fprintf(stderr, "---- daemon log ----\n%s---- end ----\n", log().c_str());
   bus_.stop();
-  dir_.reset();
+  std::error_code ec;
+  if (!std::getenv("VIREO_KEEP_TEST_DIRS")) fs::remove_all(dir_, ec);
 }
 
 std::unique_ptr<client::Client> ServiceTest::connect() {
@@ -181,8 +167,8 @@ void ServiceTest::writeFile(const std::string& path, const std::string& text) {
   fs::rename(tmp, path);
 }
 
-std::string ServiceTest::log() {
-  std::ifstream in(daemonLog_);
+std::string ServiceTest::readFile(const std::string& path) {
+  std::ifstream in(path);
   std::stringstream ss;
   ss << in.rdbuf();
   return ss.str();

@@ -23,17 +23,6 @@ namespace vireo::itest {
 
 using namespace std::chrono_literals;
 
-// A temporary directory removed with everything in it.
-class TempDir {
- public:
-  TempDir();
-  ~TempDir();
-  const std::string& path() const { return path_; }
-
- private:
-  std::string path_;
-};
-
 // A child process started with its own environment and stdout+stderr in a file.
 class ChildProcess {
  public:
@@ -61,13 +50,11 @@ class ServiceTest : public ::testing::Test {
   // Files written before the daemon starts (relative to the configuration directory).
   virtual std::map<std::string, std::string> configurationFiles() { return {}; }
   virtual void prepareRuntimeDirectory(const std::string& /*runtime*/) {}
-  // Starts the daemon (SetUp does it; tests that change files first may restart).
-  void startDaemon();
 
   std::unique_ptr<client::Client> connect();
-  void writeFile(const std::string& path, const std::string& text);
-
-  std::string log();
+  static void writeFile(const std::string& path, const std::string& text);
+  static std::string readFile(const std::string& path);
+  std::string log() { return readFile(daemonLog_); }
   bool waitForLog(const std::string& text, std::chrono::milliseconds timeout = 5s);
   // Polls fn until it is true or the timeout passes.
   template <class Fn>
@@ -84,10 +71,9 @@ class ServiceTest : public ::testing::Test {
   std::int64_t count(const std::string& sql);
   std::vector<nlohmann::json> rows(const std::string& sql);
 
-  std::unique_ptr<TempDir> dir_;
+  std::string dir_;  // removed after the test unless VIREO_KEEP_TEST_DIRS is set
   std::string busAddress_;
   std::string configDir_, stateDir_, logsDir_, runtimeDir_;
-  std::map<std::string, std::string> extraEnv_;
   ChildProcess bus_;
   ChildProcess daemon_;
   std::string daemonLog_;

@@ -20,52 +20,106 @@ class StoreTest : public ServiceTest {
     EXPECT_EQ(*c.setServiceType(type, id), true);
     return c.startReportingSessionForID(id);
   }
-  std::vector<nlohmann::json> messages(const std::string& where) {
-    return rows("SELECT * FROM telemetry_messages WHERE " + where + " ORDER BY id");
+  // Waits until the query finds at least n messages and returns them.
+  std::vector<nlohmann::json> messages(const std::string& where, std::size_t n = 1) {
+    std::vector<nlohmann::json> found;
+    eventually([&] { return (found = rows("SELECT * FROM telemetry_messages WHERE " + where + " ORDER BY id")).size() >= n; },
+               15s);
+    return found;
   }
 };
 
-TEST_F(StoreTest, MessagesAreStoredWithCleanedKeysAndShortCategory) {
+TEST_F(StoreTest, MessagesSummariesEventsAndACleanExit) {
   auto c = connect();
   ASSERT_TRUE(c);
-  auto start = startSession(*c, 5, 2);
+  // Without started sessions a broadcast goes out as a one-shot message.
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(1)}}, 0x10000008, 4));
+  auto found = messages("category = 8");
+  ASSERT_EQ(found.size(), 1u);
+  EXPECT_TRUE(found[0]["session"].is_null());
+  EXPECT_EQ(found[0]["user_info"]["service_name"], "standalone");
+  // An empty ID list reaches nobody (checked once everything is committed).
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(2)}}, 0x1000000A, 4, std::vector<std::int64_t>{}));
+
+  // Keys are cleaned, the category keeps its low 16 bits.
+  auto start5 = startSession(*c, 5, 2);
   ASSERT_TRUE(c->sendMessage(Dictionary{{"buffer size", Value(512)}, {"a  b", Value("x")}, {"ratio", Value(0.5)}},
                              0x40000003, 1, std::vector<std::int64_t>{5}));
-  std::vector<nlohmann::json> found;
-  ASSERT_TRUE(eventually([&] { return !(found = messages("type = 1")).empty(); }, 15s));
+  found = messages("type = 1");
+  ASSERT_EQ(found.size(), 1u);
   EXPECT_EQ(found[0]["category"], 3);
   EXPECT_EQ(found[0]["payload"]["buffer_size"], 512);
   EXPECT_EQ(found[0]["payload"]["a__b"], "x");
   EXPECT_EQ(found[0]["payload"]["ratio"], 0.5);
-  EXPECT_FALSE(found[0]["session"].is_null());
-
+  ASSERT_FALSE(found[0]["session"].is_null());
   auto sessions = rows("SELECT * FROM telemetry_sessions WHERE id = " + found[0]["session"].dump());
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_EQ(sessions[0]["user_info"]["service_name"], "telephony_session");
   EXPECT_TRUE(eventually([&] {
     return count("SELECT COUNT(*) FROM analytics_events WHERE name = 'com.orvane.vireo.Routing_Playback.Start'") == 1;
   }));
+
+  // A client that leaves is reported with its uptime.
+  {
+    auto brief = connect();
+    ASSERT_TRUE(brief);
+    ASSERT_EQ(*brief->createReportingSession(3), true);
+    std::this_thread::sleep_for(200ms);
+  }
+
+  // Every stop sends a summary gathering the session's entries under their
+  // message identifiers; restarted, the session counts on (its own summary was
+  // Undefined_Unknown_1, the next is Undefined_Unknown_2).
+  auto start8 = startSession(*c, 8, 7);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"a", Value(1)}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"a", Value(2)}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
+  ASSERT_EQ(*c->stopReportingSessionForID(8), true);
+  ASSERT_TRUE(start8.waitFor(5s));
+  found = messages("category = 65535 AND type = 65535");
+  ASSERT_EQ(found.size(), 1u);
+  const auto& summary = found[0]["payload"];
+  EXPECT_EQ(summary["VR_Session_Summary_Event"], "7") << summary.dump();
+  EXPECT_TRUE(summary.contains("Routing_Playback_Start_1")) << summary.dump();
+  EXPECT_TRUE(summary.contains("Routing_Playback_Start_2")) << summary.dump();
+  auto again = c->startReportingSessionForID(8);
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"b", Value("x")}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
+  ASSERT_EQ(*c->stopReportingSessionForID(8), true);
+  found = messages("category = 65535 AND type = 65535", 2);
+  ASSERT_EQ(found.size(), 2u);
+  EXPECT_TRUE(found[1]["payload"].contains("Routing_Playback_Start_3")) << found[1].dump();
+  // Only internal builds write the session file.
+  EXPECT_FALSE(fs::exists(fs::path(logsDir_) / "Audio" / "Reporting"));
+
+  std::vector<nlohmann::json> uptime;
+  ASSERT_TRUE(eventually([&] {
+    return !(uptime = rows("SELECT * FROM analytics_events WHERE name = 'com.orvane.vireo.vrreportingclientuptime'"))
+                .empty();
+  }, 10s));
+  EXPECT_TRUE(uptime[0]["payload"]["processName"].is_string());
+  EXPECT_GE(uptime[0]["payload"]["seconds"].get<double>(), 0.1);
+
+  // Pipelined sends each get their answer; SIGTERM then exits 0 with every row committed.
+  auto start6 = startSession(*c, 6, 0);
+  int answered = 0;
+  for (int i = 0; i < 20; ++i)
+    ASSERT_TRUE(c->sendMessageAsync(Dictionary{{"i", Value(i)}}, 0x08000005, 3, std::vector<std::int64_t>{6},
+                                    [&](const client::Status& s) { answered += s.ok(); }));
+  ASSERT_TRUE(eventually([&] {
+    c->pump(100ms);
+    return answered == 20;
+  }));
+  daemon_.signal(SIGTERM);
+  EXPECT_EQ(daemon_.waitExit(15s), 0);
+  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE category = 5 AND type = 3"), 20);
+  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE category = 10"), 0);
+  EXPECT_FALSE(fs::exists(fs::path(logsDir_) / "Audio" / "Reporting"));
 }
 
-TEST_F(StoreTest, BroadcastWithoutStartedSessionsGoesOutAsOneShotMessage) {
+TEST_F(StoreTest, ReportingSwitchFollowsTheNotificationAndSighup) {
   auto c = connect();
   ASSERT_TRUE(c);
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(1)}}, 0x10000008, 4));
-  std::vector<nlohmann::json> found;
-  ASSERT_TRUE(eventually([&] { return !(found = messages("category = 8")).empty(); }, 10s));
-  EXPECT_TRUE(found[0]["session"].is_null());
-  EXPECT_EQ(found[0]["user_info"]["service_name"], "standalone");
-  // An empty ID list reaches nobody.
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(2)}}, 0x10000009, 4, std::vector<std::int64_t>{}));
-  ASSERT_TRUE(c->getAllReporters());
-  std::this_thread::sleep_for(1500ms);
-  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE category = 9"), 0);
-}
-
-TEST_F(StoreTest, DisableReportingFollowsTheNotification) {
-  auto c = connect();
-  ASSERT_TRUE(c);
-  writeFile(configDir_ + "/com.orvane.vireo.conf", "disable_reporting = true\n");
+  const std::string suite = configDir_ + "/com.orvane.vireo.conf";
+  writeFile(suite, "disable_reporting = true\n");
   ASSERT_TRUE(c->postNotification(client::kReportingNotification));
   client::Status last = client::Done{};
   EXPECT_TRUE(eventually([&] { return !(last = c->sendMessage(Dictionary{{"k", Value(1)}}, 3, 1)).ok(); }));
@@ -75,101 +129,26 @@ TEST_F(StoreTest, DisableReportingFollowsTheNotification) {
   EXPECT_EQ(last.error().domain, "com.orvane.audio.reporting");
   EXPECT_EQ(last.error().code, 1);
 
-  writeFile(configDir_ + "/com.orvane.vireo.conf", "# reporting back on\n");
+  writeFile(suite, "# reporting back on\n");
   ASSERT_TRUE(c->postNotification(client::kReportingNotification));
   EXPECT_TRUE(eventually([&] { return c->sendMessage(Dictionary{{"k", Value(1)}}, 3, 1).ok(); }));
-}
 
-TEST_F(StoreTest, SighupCountsAsTheNotification) {
-  auto c = connect();
-  ASSERT_TRUE(c);
-  writeFile(configDir_ + "/com.orvane.vireo.conf", "disable_reporting=yes\n");
+  writeFile(suite, "disable_reporting=yes\n");
   daemon_.signal(SIGHUP);
   EXPECT_TRUE(eventually([&] { return !c->sendMessage(Dictionary{}, 3, 1).ok(); }));
 }
 
-TEST_F(StoreTest, SigtermExitsCleanlyWithRowsCommitted) {
-  auto c = connect();
-  ASSERT_TRUE(c);
-  auto start = startSession(*c, 6, 0);
-  for (int i = 0; i < 20; ++i)
-    ASSERT_TRUE(c->sendMessage(Dictionary{{"i", Value(i)}}, 0x08000005, 3, std::vector<std::int64_t>{6}));
-  ASSERT_TRUE(c->getAllReporters());
-  daemon_.signal(SIGTERM);
-  EXPECT_EQ(daemon_.waitExit(15s), 0);
-  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE category = 5 AND type = 3"), 20);
-}
-
-TEST_F(StoreTest, SummaryMessageAtEveryStop) {
-  auto c = connect();
-  ASSERT_TRUE(c);
-  auto start = startSession(*c, 8, 7);
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"a", Value(1)}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"a", Value(2)}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
-  ASSERT_EQ(*c->stopReportingSessionForID(8), true);
-  ASSERT_TRUE(start.waitFor(5s));
-  std::vector<nlohmann::json> found;
-  ASSERT_TRUE(eventually([&] { return !(found = messages("category = 65535 AND type = 65535")).empty(); }, 15s));
-  // The summary gathers the session's entries under their message identifiers.
-  const auto& summary = found[0]["payload"];
-  EXPECT_EQ(summary["VR_Session_Summary_Event"], "7") << summary.dump();
-  EXPECT_TRUE(summary.contains("Routing_Playback_Start_1")) << summary.dump();
-  EXPECT_TRUE(summary.contains("Routing_Playback_Start_2")) << summary.dump();
-
-  // Restarted, the session counts on (its own summary was Undefined_Unknown_1, the
-  // next is Undefined_Unknown_2) and sends a second summary.
-  auto again = c->startReportingSessionForID(8);
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"b", Value("x")}}, 0x40000003, 1, std::vector<std::int64_t>{8}));
-  ASSERT_EQ(*c->stopReportingSessionForID(8), true);
-  ASSERT_TRUE(eventually([&] { return (found = messages("category = 65535 AND type = 65535")).size() == 2; }, 15s));
-  EXPECT_TRUE(found[1]["payload"].contains("Routing_Playback_Start_3")) << found[1].dump();
-}
-
-TEST_F(StoreTest, ClientUptimeEventAfterTheClientLeaves) {
-  {
-    auto c = connect();
-    ASSERT_TRUE(c);
-    ASSERT_EQ(*c->createReportingSession(3), true);
-    std::this_thread::sleep_for(200ms);
-  }
-  std::vector<nlohmann::json> found;
-  ASSERT_TRUE(eventually(
-      [&] {
-        return !(found = rows("SELECT * FROM analytics_events WHERE name = 'com.orvane.vireo.vrreportingclientuptime'"))
-                    .empty();
-      },
-      10s));
-  EXPECT_TRUE(found[0]["payload"]["processName"].is_string());
-  EXPECT_GE(found[0]["payload"]["seconds"].get<double>(), 0.1);
-}
-
-class DriverStatisticsTest : public StoreTest {
+// An internal build with one driver reporting statistics.
+class InternalBuildTest : public StoreTest {
  protected:
+  std::map<std::string, std::string> configurationFiles() override { return {{"device.conf", "InternalBuild=true\n"}}; }
   void prepareRuntimeDirectory(const std::string& runtime) override {
     writeFile(runtime + "/stats/Speaker/Underruns", "5\n");
     writeFile(runtime + "/stats/Speaker/Overloads", "3\n");
   }
 };
 
-TEST_F(DriverStatisticsTest, StopSendsThePositiveDeltaAsCategoryNine) {
-  auto c = connect();
-  ASSERT_TRUE(c);
-  auto start = startSession(*c, 9, 0);
-  ASSERT_TRUE(c->getAllReporters());
-  writeFile(runtimeDir_ + "/stats/Speaker/Underruns", "12\n");
-  ASSERT_EQ(*c->stopReportingSessionForID(9), true);
-  std::vector<nlohmann::json> found;
-  ASSERT_TRUE(eventually([&] { return !(found = messages("category = 9 AND type = 0")).empty(); }, 15s));
-  EXPECT_EQ(found[0]["payload"]["Speaker_Underruns"], 7);
-  EXPECT_FALSE(found[0]["payload"].contains("Speaker_Overloads"));
-}
-
-class InternalBuildTest : public StoreTest {
- protected:
-  std::map<std::string, std::string> configurationFiles() override { return {{"device.conf", "InternalBuild=true\n"}}; }
-};
-
-TEST_F(InternalBuildTest, StopWritesTheSessionJsonFile) {
+TEST_F(InternalBuildTest, StopSendsTheDriverDeltaAndWritesTheSessionFile) {
   auto c = connect();
   ASSERT_TRUE(c);
   ASSERT_EQ(*c->createReportingSession(11), true);
@@ -177,8 +156,15 @@ TEST_F(InternalBuildTest, StopWritesTheSessionJsonFile) {
   ASSERT_EQ(*c->setConfiguration(Dictionary{{"HostApplicationDisplayID", Value("Player")}}, 11), true);
   auto start = c->startReportingSessionForID(11);
   ASSERT_TRUE(c->sendMessage(Dictionary{{"route", Value("speaker")}}, 0x40000003, 1, std::vector<std::int64_t>{11}));
+  writeFile(runtimeDir_ + "/stats/Speaker/Underruns", "12\n");
   ASSERT_EQ(*c->stopReportingSessionForID(11), true);
   ASSERT_TRUE(start.waitFor(5s));
+
+  // Only the positive delta goes out, as category 9.
+  auto found = messages("category = 9 AND type = 0");
+  ASSERT_EQ(found.size(), 1u);
+  EXPECT_EQ(found[0]["payload"]["Speaker_Underruns"], 7);
+  EXPECT_FALSE(found[0]["payload"].contains("Speaker_Overloads"));
 
   fs::path dir = fs::path(logsDir_) / "Audio" / "Reporting";
   fs::path file;
@@ -193,20 +179,10 @@ TEST_F(InternalBuildTest, StopWritesTheSessionJsonFile) {
   ASSERT_TRUE(content.is_array()) << file;
   ASSERT_GE(content.size(), 2u);
   EXPECT_EQ(content[0]["HostApplicationDisplayID"], "Player");
-  bool found = false;
+  bool routed = false;
   for (const auto& entry : content)
-    found = found || (entry.contains("Routing_Playback_Start_1") && entry["Routing_Playback_Start_1"]["route"] == "speaker");
-  EXPECT_TRUE(found) << content.dump(2);
-}
-
-TEST_F(StoreTest, NoJsonFileOnOtherBuilds) {
-  auto c = connect();
-  ASSERT_TRUE(c);
-  auto start = startSession(*c, 12, 2);
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"k", Value(1)}}, 3, 1, std::vector<std::int64_t>{12}));
-  ASSERT_EQ(*c->stopReportingSessionForID(12), true);
-  ASSERT_TRUE(start.waitFor(5s));
-  EXPECT_FALSE(fs::exists(fs::path(logsDir_) / "Audio" / "Reporting"));
+    routed = routed || (entry.contains("Routing_Playback_Start_1") && entry["Routing_Playback_Start_1"]["route"] == "speaker");
+  EXPECT_TRUE(routed) << content.dump(2);
 }
 
 }  // namespace
