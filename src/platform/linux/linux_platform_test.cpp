@@ -1,4 +1,5 @@
 #include <fcntl.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -69,41 +70,25 @@ TEST(KeyFile, ParsesAndConvertsValues) {
   EXPECT_FALSE(error.empty());
 }
 
-// Reads what the logger wrote into a pipe.
-class Pipe {
- public:
-  Pipe() { EXPECT_EQ(::pipe2(fds_, O_CLOEXEC), 0); }
-  ~Pipe() {
-    ::close(fds_[0]);
-    if (fds_[1] >= 0) ::close(fds_[1]);
-  }
-  int writeEnd() const { return fds_[1]; }
-  std::string drain() {
-    ::close(fds_[1]);
-    fds_[1] = -1;
-    std::string out;
-    char buf[4096];
-    ssize_t n;
-    while ((n = ::read(fds_[0], buf, sizeof buf)) > 0) out.append(buf, static_cast<size_t>(n));
-    return out;
-  }
-
- private:
-  int fds_[2] = {-1, -1};
+// A memory file that stands in for stderr.
+struct MemFile {
+  int fd = ::memfd_create("log", MFD_CLOEXEC);
+  ~MemFile() { ::close(fd); }
+  std::string text() const { return readAll("/proc/self/fd/" + std::to_string(fd)); }
 };
 
 TEST(LinuxLogger, StreamLinesCarryPriorityLocationAndText) {
-  Pipe pipe;
+  MemFile out;
   int logLine = 0;
   {
-    LinuxLogger logger("", LinuxLogger::Output::Stream, pipe.writeEnd());
+    LinuxLogger logger("", LinuxLogger::Output::Stream, out.fd);
     logger.write(LogScope::Server, LogLevel::Default, "file.cpp", 12, "-[X y]", "text");
     logger.write(LogScope::Session, LogLevel::Error, "a.cpp", 1, "f", "bad 100%");
     logger.write(LogScope::Driver, LogLevel::Info, "b.cpp", 2, "g", "");
     logLine = __LINE__ + 1;
     VR_LOG(logger, LogScope::DefaultLog, LogLevel::Debug, "-[Z w]", "n=%d", 5);
   }
-  EXPECT_EQ(pipe.drain(),
+  EXPECT_EQ(out.text(),
             "<5>file.cpp:12:-[X y]: text\n"
             "<3>a.cpp:1:f: bad 100%\n"
             "<6>b.cpp:2:g: \n"
@@ -112,9 +97,8 @@ TEST(LinuxLogger, StreamLinesCarryPriorityLocationAndText) {
 }
 
 TEST(LinuxLogger, LinesFromManyThreadsNeverInterleave) {
-  Pipe pipe;
-  ASSERT_EQ(::fcntl(pipe.writeEnd(), F_SETPIPE_SZ, 1 << 20) >= 0, true);
-  LinuxLogger logger("", LinuxLogger::Output::Stream, pipe.writeEnd());
+  MemFile out;
+  LinuxLogger logger("", LinuxLogger::Output::Stream, out.fd);
   std::vector<std::thread> threads;
   for (int t = 0; t < 4; ++t) {
     threads.emplace_back([&, t] {
@@ -123,7 +107,7 @@ TEST(LinuxLogger, LinesFromManyThreadsNeverInterleave) {
     });
   }
   for (auto& th : threads) th.join();
-  std::istringstream lines(pipe.drain());
+  std::istringstream lines(out.text());
   std::string line;
   int count = 0;
   while (std::getline(lines, line)) {
