@@ -8,7 +8,6 @@ namespace {
 using testing::FakeConnection;
 using testing::Replies;
 using testing::ServiceHarness;
-using testing::SinkCall;
 
 class RoutingTest : public ::testing::Test {
  protected:
@@ -62,8 +61,16 @@ class RoutingTest : public ::testing::Test {
   return ::testing::AssertionSuccess();
 }
 
-TEST_F(RoutingTest, AddressedReachesNamedSessionsWhetherStartedOrNot) {
-  EXPECT_TRUE(answeredWithoutError(send(std::vector<std::int64_t>{3, 2})));
+// Named sessions get the message whether started or not, after the sinks.
+TEST_F(RoutingTest, AddressedCallsTheSinksBeforeTheNamedSessions) {
+  h.journal.watch(session(3));
+  EXPECT_TRUE(answeredWithoutError(send(std::vector<std::int64_t>{3, 2}, Dictionary{{"EngineOnTime", 4.0}})));
+  auto calls = h.journal.calls();
+  ASSERT_EQ(calls.size(), 4u);
+  EXPECT_EQ(calls[0].sink, "analytics");
+  EXPECT_EQ(calls[1].sink, "energy");
+  EXPECT_EQ(calls[0].watchedPayloads, 0);
+  EXPECT_EQ(calls[1].watchedPayloads, 0);
   EXPECT_EQ(payloads(3), 1);
   EXPECT_EQ(payloads(1), 0) << "not addressed";
   EXPECT_EQ(routedEvents(), 2u);
@@ -71,18 +78,6 @@ TEST_F(RoutingTest, AddressedReachesNamedSessionsWhetherStartedOrNot) {
   h.fake.dispatcher.runLowPriority();
   ASSERT_EQ(h.fake.telemetry.oneShots().size(), 1u);
   EXPECT_EQ(h.fake.tracer.count(trace::kServerSend), 1u);
-}
-
-TEST_F(RoutingTest, AddressedCallsTheSinksBeforeTheSession) {
-  h.journal.watch(session(3));
-  send(std::vector<std::int64_t>{3}, Dictionary{{"EngineOnTime", 4.0}});
-  auto calls = h.journal.calls();
-  ASSERT_EQ(calls.size(), 2u);
-  EXPECT_EQ(calls[0].sink, "analytics");
-  EXPECT_EQ(calls[1].sink, "energy");
-  EXPECT_EQ(calls[0].watchedPayloads, 0);
-  EXPECT_EQ(calls[1].watchedPayloads, 0);
-  EXPECT_EQ(payloads(3), 1);
 }
 
 TEST_F(RoutingTest, BroadcastReachesStartedSessionsOfEveryClientSessionFirst) {
@@ -101,23 +96,6 @@ TEST_F(RoutingTest, BroadcastReachesStartedSessionsOfEveryClientSessionFirst) {
   EXPECT_TRUE(h.fake.logger.contains("active reporting sessions 2 : "));
   h.fake.dispatcher.runLowPriority();
   EXPECT_TRUE(h.fake.telemetry.oneShots().empty());
-}
-
-TEST_F(RoutingTest, BroadcastWithNothingRunningGoesOutStandalone) {
-  for (std::int64_t id : {1, 3}) (id == 1 ? a : b)->client().stopReportingSessionForID(id, nullptr);
-  h.pump();
-  h.fake.defaults.set("com.orvane.vireo", "device_name", "kitchen");
-  h.postDefaults();
-  EXPECT_TRUE(answeredWithoutError(send(std::nullopt)));
-  EXPECT_TRUE(h.fake.logger.contains("active reporting sessions 0 : []"));
-  EXPECT_TRUE(h.fake.logger.contains("no active reporting sessions found, sending as standalone"));
-  EXPECT_EQ(routedEvents(), 0u) << "the sinks are not called";
-  h.fake.dispatcher.runLowPriority();
-  auto oneShots = h.fake.telemetry.oneShots();
-  ASSERT_EQ(oneShots.size(), 1u);
-  EXPECT_EQ(*oneShots[0].userInfo.find("service_name"), Value("standalone"));
-  EXPECT_EQ(oneShots[0].category, 3);
-  EXPECT_EQ(oneShots[0].type, 1);
 }
 
 TEST_F(RoutingTest, EmptyZeroOrUnknownListsSendNothing) {

@@ -11,7 +11,7 @@ namespace vireo {
 namespace {
 
 using testing::FakeConnection;
-using testing::ProcessExited;
+using testing::FakePlatform;
 using testing::Replies;
 using testing::ServiceHarness;
 
@@ -20,12 +20,13 @@ class ServiceTest : public ::testing::Test {
   std::shared_ptr<VRReportingSession> sessionOf(const FakeConnection& c, std::int64_t id) {
     return c.instance()->findReportingSessionForID(id, false);
   }
-  // Creates (and optionally starts) a session; the start reply goes to starts.
+  // Creates a session, typed when serviceType is given.
   void create(FakeConnection& c, std::int64_t id, std::uint16_t serviceType = 0xFFFF) {
     c.client().createReportingSession(id, nullptr);
     if (serviceType != 0xFFFF) c.client().setServiceType(serviceType, id, nullptr);
     h.pump();
   }
+  // Starts a session; the start reply goes to starts.
   void start(FakeConnection& c, std::int64_t id) {
     c.client().startReportingSessionForID(id, starts.callback());
     h.pump();
@@ -35,35 +36,7 @@ class ServiceTest : public ::testing::Test {
   Replies<bool> starts;
 };
 
-// ---- replies ----
-
-TEST_F(ServiceTest, BooleanOperationsAnswerTrueOnceForAnyID) {
-  auto c = h.connect(100, "player");
-  for (std::int64_t id : {std::int64_t{0}, std::int64_t{5}, std::int64_t{99}}) {
-    Replies<bool> created, typed, configured, stopped, destroyed;
-    if (id != 99) c->client().createReportingSession(id, created.callback());
-    c->client().setServiceType(2, id, typed.callback());
-    c->client().setConfiguration(Dictionary{{"a", 1}}, id, configured.callback());
-    c->client().stopReportingSessionForID(id, stopped.callback());
-    c->client().destroyReportingSession(id, destroyed.callback());
-    EXPECT_TRUE(typed.values.empty()) << "replies only come from the server queue";
-    h.pump();
-    if (id != 99) {
-      EXPECT_EQ(created.values, std::vector<bool>{true});
-    }
-    EXPECT_EQ(typed.values, std::vector<bool>{true}) << id;
-    EXPECT_EQ(configured.values, std::vector<bool>{true}) << id;
-    EXPECT_EQ(stopped.values, std::vector<bool>{true}) << id;
-    EXPECT_EQ(destroyed.values, std::vector<bool>{true}) << id;
-  }
-  EXPECT_EQ(h.fake.tracer.count(trace::kServerCreate), 2u);
-  EXPECT_EQ(h.fake.tracer.count(trace::kServerStop), 3u);
-  EXPECT_EQ(h.fake.tracer.count(trace::kServerDestroy), 3u);
-  EXPECT_TRUE(h.fake.logger.contains("destroying 99"));
-  EXPECT_FALSE(h.fake.logger.contains("destroying 0"));
-}
-
-TEST_F(ServiceTest, ServiceTypeQueryAnswersTwiceForIDZero) {
+TEST_F(ServiceTest, QueriesAnswerTwiceForIDZeroAndWithBusKinds) {
   auto a = h.connect(100, "player");
   auto b = h.connect(200, "phone");
   create(*a, 5, 3);
@@ -72,59 +45,18 @@ TEST_F(ServiceTest, ServiceTypeQueryAnswersTwiceForIDZero) {
   a->client().getServiceNameForReporterID(42, unknown.callback());
   a->client().getServiceNameForReporterID(5, own.callback());
   b->client().getServiceNameForReporterID(5, other.callback());
+  Replies<Dictionary> known, missing;
+  a->client().reporterIDValid(5, known.callback());
+  a->client().reporterIDValid(6, missing.callback());
   h.pump();
   EXPECT_EQ(zero.values, (std::vector<std::uint16_t>{0xFFFF, 0xFFFF}));
   EXPECT_EQ(unknown.values, std::vector<std::uint16_t>{0xFFFF});
   EXPECT_EQ(own.values, std::vector<std::uint16_t>{3});
   EXPECT_EQ(other.values, std::vector<std::uint16_t>{3}) << "found across clients";
-}
-
-TEST_F(ServiceTest, StartAnswersWhenTheSessionStopsAndNeverForUnknownOrRunning) {
-  auto c = h.connect(100, "player");
-  Replies<bool> zero, unknown, again;
-  c->client().startReportingSessionForID(0, zero.callback());
-  c->client().startReportingSessionForID(77, unknown.callback());
-  create(*c, 5);
-  start(*c, 5);
-  EXPECT_EQ(zero.values, std::vector<bool>{true});
-  EXPECT_TRUE(unknown.values.empty());
-  EXPECT_TRUE(starts.values.empty()) << "held until the stop";
-  EXPECT_TRUE(sessionOf(*c, 5)->started());
-  EXPECT_EQ(h.drivers.samplesTaken(), 1);
-
-  c->client().startReportingSessionForID(5, again.callback());
-  h.pump();
-  EXPECT_EQ(h.drivers.samplesTaken(), 1) << "no second snapshot";
-
-  c->client().stopReportingSessionForID(5, nullptr);
-  h.pump();
-  EXPECT_EQ(starts.values, std::vector<bool>{true});
-  EXPECT_TRUE(again.values.empty());
-
-  // Started again: the earlier start is answered once more, the new one at its stop.
-  Replies<bool> third;
-  c->client().startReportingSessionForID(5, third.callback());
-  h.pump();
-  EXPECT_EQ(starts.values, (std::vector<bool>{true, true}));
-  EXPECT_TRUE(third.values.empty());
-  c->client().stopReportingSessionForID(5, nullptr);
-  h.pump();
-  EXPECT_EQ(third.values, std::vector<bool>{true});
-  EXPECT_TRUE(unknown.values.empty());
-  EXPECT_TRUE(again.values.empty());
-}
-
-TEST_F(ServiceTest, ValidationAnswersWithBusKinds) {
-  auto c = h.connect(100, "player");
-  create(*c, 5, 2);
-  Replies<Dictionary> known, unknown;
-  c->client().reporterIDValid(5, known.callback());
-  c->client().reporterIDValid(6, unknown.callback());
-  h.pump();
   ASSERT_EQ(known.values.size(), 1u);
-  ASSERT_EQ(unknown.values.size(), 1u);
-  EXPECT_EQ(known.values[0], (Dictionary{{"reporterID", 5}, {"serviceType", 2u}}));
-  const Dictionary& none = unknown.values[0];
+  ASSERT_EQ(missing.values.size(), 1u);
+  EXPECT_EQ(known.values[0], (Dictionary{{"reporterID", 5}, {"serviceType", 3u}}));
+  const Dictionary& none = missing.values[0];
   ASSERT_EQ(none.size(), 2u);
   EXPECT_EQ(none[0].first, Value("reporterID"));
   EXPECT_EQ(none[0].second.kind(), Value::Kind::Int);
@@ -133,23 +65,6 @@ TEST_F(ServiceTest, ValidationAnswersWithBusKinds) {
   EXPECT_EQ(none[1].second.kind(), Value::Kind::UInt);
   EXPECT_EQ(none[1].second.toInt64(), 0xFFFF);
 }
-
-TEST_F(ServiceTest, KillServiceExitsWithStatusTwoWithoutReplyOrQueueing) {
-  auto c = h.connect(100, "player");
-  Replies<bool> killed;
-  try {
-    c->client().killService(killed.callback());
-    ADD_FAILURE() << "killService returned";
-  } catch (const ProcessExited& exited) {
-    EXPECT_EQ(exited.status, 2);
-  }
-  EXPECT_EQ(h.fake.process.statuses(), std::vector<int>{2});
-  EXPECT_EQ(h.serverQueue()->pending(), 0u);
-  EXPECT_TRUE(killed.values.empty());
-  EXPECT_TRUE(h.fake.logger.contains("DESTROYING SERVICE"));
-}
-
-// ---- sessions ----
 
 TEST_F(ServiceTest, CreateUnderAnExistingIDReplacesWithoutStoppingAndKeepsItsPlace) {
   auto c = h.connect(100, "player");
@@ -168,7 +83,7 @@ TEST_F(ServiceTest, CreateUnderAnExistingIDReplacesWithoutStoppingAndKeepsItsPla
   EXPECT_EQ(reporters.values, (std::vector<std::vector<std::int64_t>>{{5, 6}}));
 }
 
-TEST_F(ServiceTest, StopSendsTheDriverDeltaIntoTheSessionBeforeStopping) {
+TEST_F(ServiceTest, StopSendsTheDriverDeltaBeforeTheSummary) {
   auto c = h.connect(100, "player");
   create(*c, 5, 2);
   h.drivers.setValue(10);
@@ -180,7 +95,6 @@ TEST_F(ServiceTest, StopSendsTheDriverDeltaIntoTheSessionBeforeStopping) {
   EXPECT_EQ(sessionOf(*c, 5)->driverSnapShot(), nullptr);
   EXPECT_TRUE(h.fake.logger.contains("fetching driver logs"));
   EXPECT_TRUE(h.fake.logger.contains("stopping 5"));
-
   auto telemetry = h.fake.telemetry.lastSession();
   ASSERT_NE(telemetry, nullptr);
   auto sent = telemetry->sent();
@@ -190,50 +104,18 @@ TEST_F(ServiceTest, StopSendsTheDriverDeltaIntoTheSessionBeforeStopping) {
   ASSERT_NE(sent[0].payload.find("Speaker_X"), nullptr);
   EXPECT_EQ(sent[0].payload.find("Speaker_X")->toInt64(), 3);
   EXPECT_EQ(sent.back().type, 0xFFFF);
-}
 
-TEST_F(ServiceTest, StopWithoutDriverGrowthStillStops) {
-  auto c = h.connect(100, "player");
-  create(*c, 5);
-  start(*c, 5);
-  c->client().stopReportingSessionForID(5, nullptr);
+  // Without driver growth the session still stops.
+  create(*c, 6);
+  start(*c, 6);
+  c->client().stopReportingSessionForID(6, nullptr);
   h.pump();
   EXPECT_TRUE(h.fake.logger.contains("nothing interesting to fetch from the drivers"));
-  EXPECT_FALSE(sessionOf(*c, 5)->started());
-  EXPECT_EQ(starts.values, std::vector<bool>{true});
+  EXPECT_FALSE(sessionOf(*c, 6)->started());
+  EXPECT_EQ(starts.values, (std::vector<bool>{true, true}));
 }
 
-TEST_F(ServiceTest, OtherClientsMayStartButNotStopOrDestroyASession) {
-  auto owner = h.connect(100, "player");
-  auto other = h.connect(200, "phone");
-  create(*owner, 5);
-  start(*other, 5);
-  ASSERT_TRUE(sessionOf(*owner, 5)->started());
-  Replies<bool> stopped, destroyed;
-  other->client().stopReportingSessionForID(5, stopped.callback());
-  other->client().destroyReportingSession(5, destroyed.callback());
-  h.pump();
-  EXPECT_EQ(stopped.values, std::vector<bool>{true});
-  EXPECT_EQ(destroyed.values, std::vector<bool>{true});
-  ASSERT_NE(sessionOf(*owner, 5), nullptr);
-  EXPECT_TRUE(sessionOf(*owner, 5)->started());
-}
-
-TEST_F(ServiceTest, DestroyStopsARunningSessionAndRemovesIt) {
-  auto c = h.connect(100, "player");
-  create(*c, 5);
-  start(*c, 5);
-  auto session = sessionOf(*c, 5);
-  c->client().destroyReportingSession(5, nullptr);
-  h.pump();
-  EXPECT_FALSE(session->started());
-  EXPECT_EQ(sessionOf(*c, 5), nullptr);
-  EXPECT_EQ(starts.values, std::vector<bool>{true});
-}
-
-// ---- registry ----
-
-TEST_F(ServiceTest, LookupAcrossClientsFollowsRegistryOrder) {
+TEST_F(ServiceTest, LookupFollowsRegistryOrderAndOnlyTheOwnerStopsOrDestroys) {
   auto first = h.connect(100, "player");
   auto second = h.connect(200, "phone");
   auto asker = h.connect(300, "alarm");
@@ -249,11 +131,21 @@ TEST_F(ServiceTest, LookupAcrossClientsFollowsRegistryOrder) {
   EXPECT_EQ(*valid.values[0].find("serviceType"), Value(1u)) << "the first connected client wins";
   EXPECT_TRUE(h.fake.logger.contains("found reporting session 9 for client 100"));
   EXPECT_EQ(reporters.values, (std::vector<std::vector<std::int64_t>>{{9, 3, 9}}));
+
+  // Other clients may start a session but not stop or destroy it.
+  start(*asker, 3);
+  ASSERT_TRUE(sessionOf(*first, 3)->started());
+  Replies<bool> stopped, destroyed;
+  asker->client().stopReportingSessionForID(3, stopped.callback());
+  asker->client().destroyReportingSession(3, destroyed.callback());
+  h.pump();
+  EXPECT_EQ(stopped.values, std::vector<bool>{true});
+  EXPECT_EQ(destroyed.values, std::vector<bool>{true});
+  ASSERT_NE(sessionOf(*first, 3), nullptr);
+  EXPECT_TRUE(sessionOf(*first, 3)->started());
 }
 
-// ---- defaults ----
-
-TEST_F(ServiceTest, DefaultsAreAbsentAndReportingOnUntilTheFirstNotification) {
+TEST_F(ServiceTest, DefaultsFollowTheNotification) {
   EXPECT_FALSE(h.delegate->getDefaults().has_value());
   EXPECT_TRUE(h.delegate->isReportingEnabled());
   auto regs = h.fake.notifications.registrations();
@@ -269,31 +161,26 @@ TEST_F(ServiceTest, DefaultsAreAbsentAndReportingOnUntilTheFirstNotification) {
   EXPECT_EQ(h.delegate->getDefaults()->find("disable_reporting")->kind(), Value::Kind::Int);
   EXPECT_TRUE(h.delegate->isReportingEnabled());
   EXPECT_TRUE(h.fake.logger.contains("re-reading vireo defaults"));
-}
 
-TEST_F(ServiceTest, DeviceNameReachesExistingSessionsOnly) {
-  auto c = h.connect(100, "player");
-  create(*c, 1);
-  create(*c, 2);
-  start(*c, 2);
-  h.fake.defaults.set("com.orvane.vireo", "device_name", "kitchen");
-  h.postDefaults();
-  create(*c, 3);
-  EXPECT_EQ(*sessionOf(*c, 1)->userInfo().find("device_name"), Value("kitchen"));
-  EXPECT_EQ(*sessionOf(*c, 2)->userInfo().find("device_name"), Value("kitchen"));
-  EXPECT_FALSE(sessionOf(*c, 3)->userInfo().contains("device_name"));
-  EXPECT_EQ(*h.delegate->getDefaults(), (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
-}
-
-TEST_F(ServiceTest, DisableReportingHidesOtherClientsAndDeletingTheKeyRestores) {
+  // The device name reaches existing sessions only.
   auto owner = h.connect(100, "player");
   auto other = h.connect(200, "phone");
+  create(*owner, 1);
   create(*owner, 9, 1);
+  start(*owner, 9);
+  h.fake.defaults.set("com.orvane.vireo", "device_name", "kitchen");
+  h.postDefaults();
+  create(*owner, 3);
+  EXPECT_EQ(*sessionOf(*owner, 1)->userInfo().find("device_name"), Value("kitchen"));
+  EXPECT_EQ(*sessionOf(*owner, 9)->userInfo().find("device_name"), Value("kitchen"));
+  EXPECT_FALSE(sessionOf(*owner, 3)->userInfo().contains("device_name"));
+  EXPECT_EQ(*h.delegate->getDefaults(), (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
+
+  // Disabled reporting hides sessions from other clients; deleting the key restores.
   h.fake.defaults.set("com.orvane.vireo", "disable_reporting", "true");
   h.postDefaults();
   EXPECT_FALSE(h.delegate->isReportingEnabled());
   EXPECT_EQ(*h.delegate->getDefaults()->find("disable_reporting"), Value(true));
-
   std::size_t before = h.fake.logger.size();
   EXPECT_EQ(h.delegate->findReportingSessionForID(9), nullptr);
   EXPECT_EQ(h.delegate->findReportingSessionForID(0), nullptr);
@@ -304,42 +191,18 @@ TEST_F(ServiceTest, DisableReportingHidesOtherClientsAndDeletingTheKeyRestores) 
   h.pump();
   EXPECT_EQ(*own.values.at(0).find("reporterID"), Value(9)) << "own map is not affected";
   EXPECT_EQ(*foreign.values.at(0).find("reporterID"), Value(0));
-
   h.fake.defaults.remove("com.orvane.vireo", "disable_reporting");
   h.postDefaults();
   EXPECT_TRUE(h.delegate->isReportingEnabled());
   EXPECT_NE(h.delegate->findReportingSessionForID(9), nullptr);
 }
 
-// ---- connection lifetime ----
-
-TEST_F(ServiceTest, AcceptedClientIsRegisteredOnTheServerQueue) {
-  h.fake.processes.setName(100, "player");
-  FakeConnection c(100, "<conn 100>");
-  EXPECT_TRUE(h.delegate->shouldAcceptNewConnection(c));
-  EXPECT_TRUE(c.resumed());
-  ASSERT_NE(c.instance(), nullptr);
-  EXPECT_TRUE(h.delegate->getAllClients().empty());
-  EXPECT_TRUE(h.fake.logger.contains("newConnection: <conn 100>"));
-  EXPECT_TRUE(h.fake.logger.contains("new client with pid 100"));
-
-  const WallTime registeredAt = h.fake.clock.now() + std::chrono::seconds(3);
-  h.fake.clock.set(registeredAt);
-  h.pump();
-  EXPECT_EQ(h.delegate->getAllClients(), std::vector{c.instance()});
-  EXPECT_EQ(c.instance()->clientStartDate(), registeredAt);
-  EXPECT_EQ(c.instance()->clientProcessName(), "player");
-}
-
 TEST_F(ServiceTest, ProcessNameLookup) {
-  h.fake.processes.setSelf(4242, "vireod");
   h.fake.processes.setName(7, "player");
   h.fake.processes.setName(0, "kernel");
   EXPECT_EQ(VRReportingProcessName(h.fake.processes, 4242), "vireod");
   EXPECT_EQ(VRReportingProcessName(h.fake.processes, 7), "player");
-  EXPECT_EQ(VRReportingProcessName(h.fake.processes, 8), std::nullopt);
-  EXPECT_EQ(VRReportingProcessName(h.fake.processes, 0), std::nullopt);
-  EXPECT_EQ(VRReportingProcessName(h.fake.processes, -3), std::nullopt);
+  for (std::int32_t pid : {8, 0, -3}) EXPECT_EQ(VRReportingProcessName(h.fake.processes, pid), std::nullopt) << pid;
 }
 
 TEST_F(ServiceTest, ConnectionErrorStopsSessionsAndActsOnlyOnce) {
@@ -364,10 +227,23 @@ TEST_F(ServiceTest, ConnectionErrorStopsSessionsAndActsOnlyOnce) {
   EXPECT_TRUE(h.fake.logger.contains("dealloc 100 from the server client list"));
 }
 
-TEST_F(ServiceTest, InvalidationSendsTheUptimeEvent) {
-  auto c = h.connect(100, "player");
+// Uptime counts from registration on the server queue, not from acceptance.
+TEST_F(ServiceTest, UptimeEventAtInvalidation) {
+  h.fake.processes.setName(100, "player");
+  FakeConnection c(100, "<conn 100>");
+  EXPECT_TRUE(h.delegate->shouldAcceptNewConnection(c));
+  EXPECT_TRUE(c.resumed());
+  EXPECT_TRUE(h.delegate->getAllClients().empty());
+  EXPECT_TRUE(h.fake.logger.contains("newConnection: <conn 100>"));
+  EXPECT_TRUE(h.fake.logger.contains("new client with pid 100"));
+  h.fake.clock.advance(std::chrono::seconds(3));
+  const WallTime registeredAt = h.fake.clock.now();
+  h.pump();
+  EXPECT_EQ(h.delegate->getAllClients(), std::vector{c.instance()});
+  EXPECT_EQ(c.instance()->clientStartDate(), registeredAt);
+  EXPECT_EQ(c.instance()->clientProcessName(), "player");
   h.fake.clock.advance(std::chrono::milliseconds(2500));
-  c->invalidate();
+  c.invalidate();
   h.pump();
   auto events = h.fake.analytics.events();
   ASSERT_EQ(events.size(), 1u);
@@ -376,46 +252,31 @@ TEST_F(ServiceTest, InvalidationSendsTheUptimeEvent) {
   EXPECT_TRUE(h.fake.logger.contains("InvalidationHandler: connection exited process=player uptime_sec=2"));
   EXPECT_FALSE(h.fake.logger.contains("clientStartDate is"));
   EXPECT_TRUE(h.delegate->getAllClients().empty());
-}
 
-TEST_F(ServiceTest, AClockMovedBackStillGivesAPositiveUptime) {
-  auto c = h.connect(100, "player");
+  // A clock moved back still gives a positive uptime.
+  auto back = h.connect(101, "phone");
   h.fake.clock.advance(-std::chrono::seconds(1));
-  c->invalidate();
-  EXPECT_TRUE(h.fake.logger.contains("clientStartDate is in the past. clientpid=100 clientprocessname=player"));
-  auto events = h.fake.analytics.events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(*events[0].payload.find("seconds"), Value(1.0));
-}
+  back->invalidate();
+  EXPECT_TRUE(h.fake.logger.contains("clientStartDate is in the past. clientpid=101 clientprocessname=phone"));
+  events = h.fake.analytics.events();
+  ASSERT_EQ(events.size(), 2u);
+  EXPECT_EQ(*events[1].payload.find("seconds"), Value(1.0));
 
-TEST_F(ServiceTest, UnknownProcessNameSendsNoEvent) {
-  auto c = h.connect(100);
-  c->invalidate();
-  EXPECT_TRUE(h.fake.analytics.events().empty());
-  EXPECT_TRUE(h.fake.logger.contains("clientProcessName is nil. clientpid=100"));
+  // No process name, or not registered yet: no event.
+  auto unnamed = h.connect(102);
+  unnamed->invalidate();
+  EXPECT_TRUE(h.fake.logger.contains("clientProcessName is nil. clientpid=102"));
   EXPECT_TRUE(h.fake.logger.contains("process=(null) uptime_sec=0"));
-}
-
-TEST_F(ServiceTest, InvalidationBeforeRegistrationLeavesNoClientBehind) {
-  h.fake.processes.setName(100, "player");
-  FakeConnection c(100, "<conn 100>");
-  h.delegate->shouldAcceptNewConnection(c);
-  c.invalidate();
-  EXPECT_TRUE(h.fake.logger.contains("clientStartDate is nil. clientpid=100 clientprocessname=unknown"));
+  h.fake.processes.setName(103, "early");
+  FakeConnection early(103, "<conn 103>");
+  h.delegate->shouldAcceptNewConnection(early);
+  early.invalidate();
+  EXPECT_TRUE(h.fake.logger.contains("clientStartDate is nil. clientpid=103 clientprocessname=unknown"));
   EXPECT_TRUE(h.fake.logger.contains("uptime_sec=-1"));
-  EXPECT_TRUE(h.fake.analytics.events().empty());
+  EXPECT_EQ(h.fake.analytics.events().size(), 2u);
   h.pump();  // registration, then the queued removal
   EXPECT_TRUE(h.delegate->getAllClients().empty());
 }
-
-}  // namespace
-}  // namespace vireo
-
-namespace vireo {
-namespace {
-
-using testing::FakeConnection;
-using testing::FakePlatform;
 
 // Clients call from their own threads while the defaults change, on the real pool:
 // every operation only queues, so all replies arrive and nothing races (run under

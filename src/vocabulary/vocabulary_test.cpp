@@ -12,39 +12,21 @@ namespace {
 
 using testing::FakePlatform;
 
-TEST(VocabularyLabels, CategoryComposesAreaAndKind) {
-  EXPECT_EQ(VRReportingCategoryName(0x40000003), "Routing_Playback");
-  EXPECT_EQ(VRReportingCategoryName(0x10000008), "DSP_Error");
-  EXPECT_EQ(VRReportingCategoryName(0x80000000), "Toolbox_Undefined");
-  EXPECT_EQ(VRReportingCategoryName(0x08000006), "Session_ClientRequest");
-  EXPECT_EQ(VRReportingCategoryName(0x20000009), "HAL_HWReporting");
-  EXPECT_EQ(VRReportingCategoryName(3), "Playback");
-  EXPECT_EQ(VRReportingCategoryName(11), "Volume");
-  EXPECT_EQ(VRReportingCategoryName(0), "Undefined");
-  EXPECT_EQ(VRReportingCategoryName(12), "Undefined");
-  EXPECT_EQ(VRReportingCategoryName(0x0000FFFF), "Undefined");
+TEST(VocabularyLabels, CategoryTypeAndServiceTables) {
   // Unrecognised areas keep a bare separator; combined area bits are not recognised.
-  EXPECT_EQ(VRReportingCategoryName(0x00010005), "_Setup");
-  EXPECT_EQ(VRReportingCategoryName(0x0001000B), "_Volume");
-  EXPECT_EQ(VRReportingCategoryName(0x30000001), "_Generic");
-  EXPECT_EQ(VRReportingCategoryName(0xFFFFFFFF), "Undefined");
-}
-
-TEST(VocabularyLabels, TypeAndServiceTables) {
-  EXPECT_EQ(VRReportingTypeName(0), "Generic");
-  EXPECT_EQ(VRReportingTypeName(5), "IssueDetector");
-  EXPECT_EQ(VRReportingTypeName(6), "Undefined");
-  EXPECT_EQ(VRReportingTypeName(65535), "Unknown");
-  EXPECT_EQ(VRReportingTypeName(0x0001FFFF), "Undefined");
-
-  EXPECT_EQ(VRReportingServiceTypeName(0), "generic");
-  EXPECT_EQ(VRReportingServiceTypeName(1), "vesper");
-  EXPECT_EQ(VRReportingServiceTypeName(8), "nonlongformaudio");
-  EXPECT_EQ(VRReportingServiceTypeName(11), "test");
-  EXPECT_EQ(VRReportingServiceTypeName(65535), "unknown");
-  EXPECT_FALSE(VRReportingServiceTypeName(12).has_value());
-  EXPECT_FALSE(VRReportingServiceTypeName(65534).has_value());
-  EXPECT_FALSE(VRReportingServiceTypeName(0x0001FFFF).has_value());
+  const std::pair<std::uint32_t, const char*> categories[] = {
+      {0x40000003, "Routing_Playback"}, {0x10000008, "DSP_Error"}, {0x80000000, "Toolbox_Undefined"},
+      {0x08000006, "Session_ClientRequest"}, {0x20000009, "HAL_HWReporting"}, {3, "Playback"}, {11, "Volume"},
+      {0, "Undefined"}, {12, "Undefined"}, {0x0000FFFF, "Undefined"}, {0xFFFFFFFF, "Undefined"},
+      {0x00010005, "_Setup"}, {0x0001000B, "_Volume"}, {0x30000001, "_Generic"}};
+  for (auto [category, name] : categories) EXPECT_EQ(VRReportingCategoryName(category), name) << category;
+  const std::pair<std::uint32_t, const char*> types[] = {
+      {0, "Generic"}, {5, "IssueDetector"}, {6, "Undefined"}, {65535, "Unknown"}, {0x0001FFFF, "Undefined"}};
+  for (auto [type, name] : types) EXPECT_EQ(VRReportingTypeName(type), name) << type;
+  const std::pair<std::uint32_t, std::optional<std::string>> services[] = {
+      {0, "generic"}, {1, "vesper"}, {8, "nonlongformaudio"}, {11, "test"}, {65535, "unknown"},
+      {12, std::nullopt}, {65534, std::nullopt}, {0x0001FFFF, std::nullopt}};
+  for (auto& [service, name] : services) EXPECT_EQ(VRReportingServiceTypeName(service), name) << service;
   EXPECT_EQ(serviceNameOrUnknown(12), "unknown");
   EXPECT_EQ(serviceNameOrUnknown(2), "telephony");
 }
@@ -76,18 +58,14 @@ void awaitWaitLines(const testing::RecordingLogger& logger, std::size_t times) {
   while (logger.count("waiting") < times) std::this_thread::sleep_for(std::chrono::milliseconds(1));
 }
 
-TEST(BoundedWait, FlagAlreadySetReturnsAtOnceWithoutLogging) {
+TEST(BoundedWait, SetFlagReturnsAtOnceAndSilenceGivesUpAfterOneInterval) {
   FakePlatform p;
   ReportingCondition cond;
   bool done = true;
   EXPECT_TRUE(VRReportingUtilityWait(cond, &done, "waiting", "gave up", p.logger, LogScope::Session, 30.0));
   EXPECT_EQ(p.logger.size(), 0u);
-}
 
-TEST(BoundedWait, SilenceGivesUpAfterOneInterval) {
-  FakePlatform p;
-  ReportingCondition cond;
-  bool done = false;
+  done = false;
   EXPECT_FALSE(VRReportingUtilityWait(cond, &done, "waiting", "gave up", p.logger, LogScope::Session, 0.02));
   auto lines = p.logger.entries();
   ASSERT_EQ(lines.size(), 2u);

@@ -1,6 +1,6 @@
 // Fakes and a harness for the service host and server instance tests: a client
-// connection the test ends by hand, a driver library with one growing channel, and
-// sinks that note what a watched session held when they were called.
+// connection the test ends by hand, and sinks that note what a watched session held
+// when they were called.
 #pragma once
 
 #include <cstdint>
@@ -35,12 +35,8 @@ class FakeConnection : public ClientConnection {
     return std::dynamic_pointer_cast<VRReportingServerInstance>(exported_);
   }
   VRReportingServiceProtocol& client() const { return *exported_; }
-  void interrupt() const {
-    if (interruption_) interruption_();
-  }
-  void invalidate() const {
-    if (invalidation_) invalidation_();
-  }
+  void interrupt() const { interruption_(); }
+  void invalidate() const { invalidation_(); }
   // The connection service lets go of the exported object and the handlers.
   void release() {
     exported_.reset();
@@ -57,72 +53,6 @@ class FakeConnection : public ClientConnection {
   bool resumed_ = false;
 };
 
-// One driver ("Speaker", no subgroup) with one channel "X" whose value the test sets;
-// deltas are later minus earlier. Every other driver has no channels.
-class GrowingDriverStats : public DriverStatsLibrary {
- public:
-  struct Channels : DriverChannelSet {
-    bool speaker = false;
-  };
-  struct Subscribed : DriverSubscribedChannels {
-    std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<Subscribed>(); }
-  };
-  struct Samples : DriverSampleSet, DriverChannel {
-    explicit Samples(std::int64_t v) : value(v) {}
-    std::unique_ptr<DriverSampleSet> copy() const override { return std::make_unique<Samples>(value); }
-    std::int64_t value;
-  };
-
-  void setValue(std::int64_t v) {
-    std::lock_guard guard(lock_);
-    value_ = v;
-  }
-  int samplesTaken() const {
-    std::lock_guard guard(lock_);
-    return samplesTaken_;
-  }
-
-  std::unique_ptr<DriverChannelSet> copyChannelsInGroup(const std::optional<std::string>& group,
-                                                        const std::optional<std::string>&, std::uint64_t,
-                                                        std::optional<DriverStatsError>*) override {
-    auto set = std::make_unique<Channels>();
-    set->speaker = group == "Speaker";
-    return set;
-  }
-  std::int32_t channelCount(const DriverChannelSet& set) override {
-    return static_cast<const Channels&>(set).speaker ? 1 : 0;
-  }
-  DriverSubscriptionHandle createSubscription(const DriverChannelSet&,
-                                              std::unique_ptr<DriverSubscribedChannels>* subscribed) override {
-    *subscribed = std::make_unique<Subscribed>();
-    return this;
-  }
-  std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle, const DriverSubscribedChannels&,
-                                                 std::optional<DriverStatsError>*) override {
-    std::lock_guard guard(lock_);
-    ++samplesTaken_;
-    return std::make_unique<Samples>(value_);
-  }
-  std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet* earlier, const DriverSampleSet& later,
-                                                      std::optional<DriverStatsError>*) override {
-    std::int64_t before = earlier ? static_cast<const Samples*>(earlier)->value : 0;
-    return std::make_unique<Samples>(static_cast<const Samples&>(later).value - before);
-  }
-  void iterate(const DriverSampleSet& samples,
-               const std::function<DriverIterate(const DriverChannel&)>& visitor) override {
-    visitor(static_cast<const Samples&>(samples));
-  }
-  std::optional<std::string> channelName(const DriverChannel&) override { return "X"; }
-  std::int64_t simpleIntegerValue(const DriverChannel& channel) override {
-    return static_cast<const Samples&>(channel).value;
-  }
-
- private:
-  mutable std::mutex lock_;  // guards value_ and samplesTaken_
-  std::int64_t value_ = 0;
-  int samplesTaken_ = 0;
-};
-
 // What the sinks saw, in call order, with the size of a watched session's payload
 // array at that moment (-1 when nothing is watched or the session is stopped).
 struct SinkCall {
@@ -132,30 +62,24 @@ struct SinkCall {
 
 class SinkJournal {
  public:
-  void watch(std::shared_ptr<VRReportingSession> session) {
-    std::lock_guard guard(lock_);
-    watched_ = std::move(session);
-  }
+  void watch(std::shared_ptr<VRReportingSession> session) { Guard guard(lock_); watched_ = std::move(session); }
   void note(std::string sink) {
     std::shared_ptr<VRReportingSession> session;
     {
-      std::lock_guard guard(lock_);
+      Guard guard(lock_);
       session = watched_;
     }
     long size = -1;
     if (session) {
       if (auto payloads = session->aggregatedPayloadData()) {
-        std::lock_guard payloadGuard(payloads->lock);
+        Guard payloadGuard(payloads->lock);
         size = static_cast<long>(payloads->entries.size());
       }
     }
-    std::lock_guard guard(lock_);
+    Guard guard(lock_);
     calls_.push_back({std::move(sink), size});
   }
-  std::vector<SinkCall> calls() const {
-    std::lock_guard guard(lock_);
-    return calls_;
-  }
+  std::vector<SinkCall> calls() const { Guard guard(lock_); return calls_; }
 
  private:
   mutable std::mutex lock_;  // guards watched_ and calls_
@@ -163,42 +87,37 @@ class SinkJournal {
   std::vector<SinkCall> calls_;
 };
 
-class JournalingAnalytics : public AnalyticsService {
- public:
-  JournalingAnalytics(AnalyticsService& inner, SinkJournal& journal) : inner_(inner), journal_(journal) {}
+// Sinks that note the call in the journal, then pass it on.
+struct JournalingAnalytics : AnalyticsService {
+  JournalingAnalytics(AnalyticsService& inner, SinkJournal& journal) : inner(inner), journal(journal) {}
   void sendEventLazy(std::string_view name, const std::function<Dictionary()>& payload) override {
-    journal_.note("analytics");
-    inner_.sendEventLazy(name, payload);
+    journal.note("analytics");
+    inner.sendEventLazy(name, payload);
   }
-
- private:
-  AnalyticsService& inner_;
-  SinkJournal& journal_;
+  AnalyticsService& inner;
+  SinkJournal& journal;
 };
 
-class JournalingEnergyLog : public EnergyLogService {
- public:
-  JournalingEnergyLog(EnergyLogService& inner, SinkJournal& journal) : inner_(inner), journal_(journal) {}
+struct JournalingEnergyLog : EnergyLogService {
+  JournalingEnergyLog(EnergyLogService& inner, SinkJournal& journal) : inner(inner), journal(journal) {}
   void logEvent(int client, std::string_view name, const Dictionary& event) override {
-    journal_.note("energy");
-    inner_.logEvent(client, name, event);
+    journal.note("energy");
+    inner.logEvent(client, name, event);
   }
-
- private:
-  EnergyLogService& inner_;
-  SinkJournal& journal_;
+  EnergyLogService& inner;
+  SinkJournal& journal;
 };
 
 // The service delegate over the fakes, with the server queue pumped by hand.
 struct ServiceHarness {
   FakePlatform fake;
-  GrowingDriverStats drivers;
+  FakeDriverStats& drivers = fake.driverStats;
   SinkJournal journal;
   JournalingAnalytics analytics{fake.analytics, journal};
   JournalingEnergyLog energyLog{fake.energyLog, journal};
   Platform platform{fake.logger,    fake.tracer,        fake.clock,    fake.random,    fake.dispatcher,
                     fake.telemetry, analytics,          energyLog,     fake.defaults,  fake.notifications,
-                    fake.device,    fake.processes,     fake.files,    drivers,        fake.process};
+                    fake.device,    fake.processes,     fake.files,    fake.driverStats, fake.process};
   std::shared_ptr<ReportingEnvironment> env = std::make_shared<ReportingEnvironment>(platform);
   std::shared_ptr<VRReportingServiceDelegate> delegate = VRReportingServiceDelegate::init(env);
 
