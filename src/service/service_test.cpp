@@ -86,9 +86,9 @@ TEST_F(ServiceTest, CreateUnderAnExistingIDReplacesWithoutStoppingAndKeepsItsPla
 TEST_F(ServiceTest, StopSendsTheDriverDeltaBeforeTheSummary) {
   auto c = h.connect(100, "player");
   create(*c, 5, 2);
-  h.drivers.setValue(10);
+  h.fake.driverStats.setValue(10);
   start(*c, 5);
-  h.drivers.setValue(13);
+  h.fake.driverStats.setValue(13);
   c->client().stopReportingSessionForID(5, nullptr);
   h.pump();
   EXPECT_FALSE(sessionOf(*c, 5)->started());

@@ -391,6 +391,7 @@ struct AnalyticsEvent {
 class FakeAnalyticsService : public AnalyticsService {
  public:
   void sendEventLazy(std::string_view name, const std::function<Dictionary()>& payload) override {
+    if (onCall) onCall();
     {
       Guard guard(lock_);
       if (unwanted_.count(std::string(name))) {
@@ -406,6 +407,7 @@ class FakeAnalyticsService : public AnalyticsService {
   void addUnwanted(std::string name) { Guard guard(lock_); unwanted_.insert(std::move(name)); }
   std::vector<AnalyticsEvent> events() const { return locked(lock_, events_); }
   std::vector<std::string> skipped() const { return locked(lock_, skipped_); }
+  std::function<void()> onCall;  // runs first in every call; set before any thread runs
 
  private:
   mutable std::mutex lock_;
@@ -423,10 +425,12 @@ struct EnergyEvent {
 class FakeEnergyLogService : public EnergyLogService {
  public:
   void logEvent(int client, std::string_view name, const Dictionary& event) override {
+    if (onCall) onCall();
     Guard guard(lock_);
     events_.push_back({client, std::string(name), event});
   }
   std::vector<EnergyEvent> events() const { return locked(lock_, events_); }
+  std::function<void()> onCall;  // runs first in every call; set before any thread runs
 
  private:
   mutable std::mutex lock_;
@@ -655,6 +659,7 @@ struct FakePlatform {
   FakePlatform(const FakePlatform&) = delete;
   FakePlatform& operator=(const FakePlatform&) = delete;
   ~FakePlatform() {
+    analytics.onCall = energyLog.onCall = nullptr;
     telemetry.dropHeld();
     notifications.clear();
     dispatcher.clear();

@@ -1,6 +1,5 @@
-// Fakes and a harness for the service host and server instance tests: a client
-// connection the test ends by hand, and sinks that note what a watched session held
-// when they were called.
+// A client connection the test ends by hand, and a harness for the service host and
+// server instance tests.
 #pragma once
 
 #include <cstdint>
@@ -53,85 +52,10 @@ class FakeConnection : public ClientConnection {
   bool resumed_ = false;
 };
 
-// What the sinks saw, in call order, with the size of a watched session's payload
-// array at that moment (-1 when nothing is watched or the session is stopped).
-struct SinkCall {
-  std::string sink;
-  long watchedPayloads;
-};
-
-class SinkJournal {
- public:
-  void watch(std::shared_ptr<VRReportingSession> session) { Guard guard(lock_); watched_ = std::move(session); }
-  void note(std::string sink) {
-    std::shared_ptr<VRReportingSession> session;
-    {
-      Guard guard(lock_);
-      session = watched_;
-    }
-    long size = -1;
-    if (session) {
-      if (auto payloads = session->aggregatedPayloadData()) {
-        Guard payloadGuard(payloads->lock);
-        size = static_cast<long>(payloads->entries.size());
-      }
-    }
-    Guard guard(lock_);
-    calls_.push_back({std::move(sink), size});
-  }
-  std::vector<SinkCall> calls() const { Guard guard(lock_); return calls_; }
-
- private:
-  mutable std::mutex lock_;  // guards watched_ and calls_
-  std::shared_ptr<VRReportingSession> watched_;
-  std::vector<SinkCall> calls_;
-};
-
-// Sinks that note the call in the journal, then pass it on.
-struct JournalingAnalytics : AnalyticsService {
-  JournalingAnalytics(AnalyticsService& inner, SinkJournal& journal) : inner(inner), journal(journal) {}
-  void sendEventLazy(std::string_view name, const std::function<Dictionary()>& payload) override {
-    journal.note("analytics");
-    inner.sendEventLazy(name, payload);
-  }
-  AnalyticsService& inner;
-  SinkJournal& journal;
-};
-
-struct JournalingEnergyLog : EnergyLogService {
-  JournalingEnergyLog(EnergyLogService& inner, SinkJournal& journal) : inner(inner), journal(journal) {}
-  void logEvent(int client, std::string_view name, const Dictionary& event) override {
-    journal.note("energy");
-    inner.logEvent(client, name, event);
-  }
-  EnergyLogService& inner;
-  SinkJournal& journal;
-};
-
 // The service delegate over the fakes, with the server queue pumped by hand.
 struct ServiceHarness {
   FakePlatform fake;
-  FakeDriverStats& drivers = fake.driverStats;
-  SinkJournal journal;
-  JournalingAnalytics analytics{fake.analytics, journal};
-  JournalingEnergyLog energyLog{fake.energyLog, journal};
-  Platform platform{fake.logger,    fake.tracer,        fake.clock,    fake.random,    fake.dispatcher,
-                    fake.telemetry, analytics,          energyLog,     fake.defaults,  fake.notifications,
-                    fake.device,    fake.processes,     fake.files,    fake.driverStats, fake.process};
-  std::shared_ptr<ReportingEnvironment> env = std::make_shared<ReportingEnvironment>(platform);
-  std::shared_ptr<VRReportingServiceDelegate> delegate = VRReportingServiceDelegate::init(env);
-
-  ServiceHarness() = default;
-  ServiceHarness(const ServiceHarness&) = delete;
-  ServiceHarness& operator=(const ServiceHarness&) = delete;
-  // Held closures reach this platform, not the bundle's: drop them while it lives.
-  ~ServiceHarness() {
-    journal.watch(nullptr);
-    delegate.reset();
-    fake.telemetry.dropHeld();
-    fake.notifications.clear();
-    fake.dispatcher.clear();
-  }
+  std::shared_ptr<VRReportingServiceDelegate> delegate = VRReportingServiceDelegate::init(fake.env);
 
   std::shared_ptr<ManualQueue> serverQueue() const { return fake.dispatcher.queue(kServerQueueLabel); }
   // Runs the server queue (and sessions' queues) until idle; low-priority work stays held.
