@@ -1,21 +1,15 @@
 #include "drivers/driver_utility.h"
 
-#include <stdlib.h>
-
-#include <filesystem>
-#include <fstream>
 #include <map>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include "fakes/fake_platform.h"
-#include "platform/linux/stats_tree.h"
 
 namespace vireo {
 namespace {
 
-namespace fs = std::filesystem;
 using ::testing::ElementsAre;
 
 std::vector<std::string> messages(const testing::RecordingLogger& logger) {
@@ -30,95 +24,7 @@ Dictionary dict(std::initializer_list<std::pair<const char*, std::int64_t>> entr
   return d;
 }
 
-// ---- With the real statistics tree ----
-
-struct TreeFixture : ::testing::Test {
-  std::string pattern = (fs::temp_directory_path() / "vireo-drivers-XXXXXX").string();
-  fs::path root_ = ::mkdtemp(pattern.data()) ? pattern : std::string();
-  fs::path stats_ = root_ / "stats";
-  testing::RecordingLogger logger_;
-  ~TreeFixture() override {
-    std::error_code ec;
-    fs::remove_all(root_, ec);
-  }
-  void write(const std::string& relative, const std::string& text) {
-    fs::create_directories((stats_ / relative).parent_path());
-    std::ofstream(stats_ / relative, std::ios::trunc) << text;
-  }
-};
-
-TEST_F(TreeFixture, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
-  write("OrvaneTK4HB/rx", "10");
-  write("OrvaneTK4HB/dsp/overruns", "0");
-  write("Speaker/x", "5");
-  write("A/MCA/drops", "1");
-  write("B/MCA/drops", "3");
-  write("Haptics/Stats/on", "0");
-  write("Haptics/Other/ignored", "0");
-  linux_platform::StatsTreeLibrary library(stats_.string());
-  VRReportingDriverUtility utility(library, logger_);
-  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
-
-  auto snapshot = utility.getSnapShot();
-  std::vector<std::string> keys;
-  for (const auto& [key, set] : snapshot->samples) keys.push_back(key);
-  EXPECT_THAT(keys, ElementsAre("OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"));
-
-  // Nothing grew yet.
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
-
-  write("OrvaneTK4HB/rx", "15");
-  write("OrvaneTK4HB/dsp/overruns", "2");
-  write("Speaker/x", "3");        // went down: not reported
-  write("A/MCA/drops", "4");      // +3, then replaced by B's +7 under the same key
-  write("B/MCA/drops", "10");
-  write("Haptics/Stats/on", "2");
-  write("Haptics/Other/ignored", "9");
-  auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
-  ASSERT_TRUE(delta);
-  EXPECT_EQ(*delta, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"MCA_drops", 7},
-                          {"Haptics_Stats_on", 2}}));
-  EXPECT_EQ(delta->find("MCA_drops")->kind(), Value::Kind::Int);
-
-  // Without a snapshot: absolute values of at least 1.
-  auto absolute = utility.getDriverStatisticsRelativeToSnapShot(nullptr);
-  ASSERT_TRUE(absolute);
-  EXPECT_EQ(*absolute, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 15}, {"Speaker_x", 3},
-                             {"MCA_drops", 10}, {"Haptics_Stats_on", 2}}));
-}
-
-TEST_F(TreeFixture, NoChannelsMeansNoSubscriptionsEmptySnapshotAndNoDelta) {
-  linux_platform::StatsTreeLibrary library(stats_.string());  // no tree at all
-  VRReportingDriverUtility utility(library, logger_);
-  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
-  EXPECT_THAT(messages(logger_),
-              ElementsAre("creating hwreporting driver utility",
-                          "couldn't find any channels for driver group OrvaneTK4HB-(null)",
-                          "subscribed to group group OrvaneTK4HB-(null)",
-                          "couldn't find any channels for driver group Speaker-(null)",
-                          "subscribed to group group Speaker-(null)",
-                          "couldn't find any channels for driver group (null)-MCA",
-                          "subscribed to group group (null)-MCA",
-                          "couldn't find any channels for driver group Haptics-Stats",
-                          "subscribed to group group Haptics-Stats"));
-  for (const auto& line : logger_.entries()) {
-    EXPECT_EQ(line.scope, LogScope::Driver);
-    EXPECT_EQ(line.function, "-[VRReportingDriverUtility init]");
-  }
-  EXPECT_EQ(logger_.entries()[0].level, LogLevel::Info);
-  EXPECT_EQ(logger_.entries()[1].level, LogLevel::Info);
-  EXPECT_EQ(logger_.entries()[2].level, LogLevel::Default);
-
-  logger_.clear();
-  auto snapshot = utility.getSnapShot();
-  EXPECT_TRUE(snapshot->samples.empty());
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), std::nullopt);
-  EXPECT_TRUE(logger_.entries().empty());
-}
-
-// ---- With a scripted library, for the failures the tree never produces ----
-
+// A scripted library, also for the failures a real one rarely produces.
 struct FakeChannel : DriverChannel {
   std::optional<std::string> name;
   std::int64_t value = 0;
@@ -215,6 +121,78 @@ FakeChannel channel(std::optional<std::string> name, std::int64_t value) {
   c.name = std::move(name);
   c.value = value;
   return c;
+}
+
+TEST(DriverUtility, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
+  ScriptedLibrary library;
+  auto& orvane = library.drivers["OrvaneTK4HB-(null)"].values;
+  auto& speaker = library.drivers["Speaker-(null)"].values;
+  auto& mca = library.drivers["(null)-MCA"].values;  // one channel name in two groups
+  auto& haptics = library.drivers["Haptics-Stats"].values;
+  orvane = {channel("overruns", 0), channel("rx", 10)};
+  speaker = {channel("x", 5)};
+  mca = {channel("drops", 1), channel("drops", 3)};
+  haptics = {channel("on", 0)};
+  testing::RecordingLogger logger;
+  VRReportingDriverUtility utility(library, logger);
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
+
+  auto snapshot = utility.getSnapShot();
+  std::vector<std::string> keys;
+  for (const auto& [key, set] : snapshot->samples) keys.push_back(key);
+  EXPECT_THAT(keys, ElementsAre("OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"));
+
+  // Nothing grew yet.
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
+
+  orvane = {channel("overruns", 2), channel("rx", 15)};
+  speaker = {channel("x", 3)};                       // went down: not reported
+  mca = {channel("drops", 4), channel("drops", 10)};  // +3, then replaced by +7 under the same key
+  haptics = {channel("on", 2)};
+  auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
+  ASSERT_TRUE(delta);
+  EXPECT_EQ(*delta, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"MCA_drops", 7},
+                          {"Haptics_Stats_on", 2}}));
+  EXPECT_EQ(delta->find("MCA_drops")->kind(), Value::Kind::Int);
+
+  // Without a snapshot: absolute values of at least 1.
+  auto absolute = utility.getDriverStatisticsRelativeToSnapShot(nullptr);
+  ASSERT_TRUE(absolute);
+  EXPECT_EQ(*absolute, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 15}, {"Speaker_x", 3},
+                             {"MCA_drops", 10}, {"Haptics_Stats_on", 2}}));
+}
+
+TEST(DriverUtility, NoChannelsMeansNoSubscriptionsEmptySnapshotAndNoDelta) {
+  ScriptedLibrary library;
+  for (const char* driver : {"OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"})
+    library.drivers[driver].channels = 0;
+  testing::RecordingLogger logger;
+  VRReportingDriverUtility utility(library, logger);
+  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
+  EXPECT_THAT(messages(logger),
+              ElementsAre("creating hwreporting driver utility",
+                          "couldn't find any channels for driver group OrvaneTK4HB-(null)",
+                          "subscribed to group group OrvaneTK4HB-(null)",
+                          "couldn't find any channels for driver group Speaker-(null)",
+                          "subscribed to group group Speaker-(null)",
+                          "couldn't find any channels for driver group (null)-MCA",
+                          "subscribed to group group (null)-MCA",
+                          "couldn't find any channels for driver group Haptics-Stats",
+                          "subscribed to group group Haptics-Stats"));
+  for (const auto& line : logger.entries()) {
+    EXPECT_EQ(line.scope, LogScope::Driver);
+    EXPECT_EQ(line.function, "-[VRReportingDriverUtility init]");
+  }
+  EXPECT_EQ(logger.entries()[0].level, LogLevel::Info);
+  EXPECT_EQ(logger.entries()[1].level, LogLevel::Info);
+  EXPECT_EQ(logger.entries()[2].level, LogLevel::Default);
+
+  logger.clear();
+  auto snapshot = utility.getSnapShot();
+  EXPECT_TRUE(snapshot->samples.empty());
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), std::nullopt);
+  EXPECT_TRUE(logger.entries().empty());
 }
 
 TEST(DriverUtilityFailures, CopyAndSubscriptionErrors) {
