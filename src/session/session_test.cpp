@@ -184,7 +184,9 @@ TEST_F(SessionTest, BackendAnswers) {
     EXPECT_EQ(s->skylarkReportingSession() != nullptr, c.kept);
     EXPECT_EQ(p.telemetry.lastSession()->sent().size(), c.kept ? 1u : 0u);
     EXPECT_EQ(p.logger.count("failed to find backend"), c.kept ? 0u : 1u);
-    EXPECT_EQ(p.logger.count("waiting for skylarkreportingd to find backends"), c.kept ? 0u : 1u);
+    if (!c.ownThread) {  // an answer from another thread may come after the wait began
+      EXPECT_EQ(p.logger.count("waiting for skylarkreportingd to find backends"), c.kept ? 0u : 1u);
+    }
     auto dropped = p.logger.matching("No valid SkylarkReportingSession");
     ASSERT_EQ(dropped.size(), c.kept ? 0u : 1u);
     if (!c.kept) {

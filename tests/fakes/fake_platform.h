@@ -37,6 +37,25 @@ T locked(std::mutex& lock, const T& field) {
   return field;
 }
 
+// Takes the oldest item out under the lock; nullopt when there is none.
+template <typename T>
+std::optional<T> popFront(std::mutex& lock, std::deque<T>& items) {
+  Guard guard(lock);
+  if (items.empty()) return std::nullopt;
+  T item = std::move(items.front());
+  items.pop_front();
+  return item;
+}
+
+// Empties a field under the lock; the old contents (closures that may own engine
+// objects) are destroyed after it is released.
+template <typename T>
+void dropAll(std::mutex& lock, T& field) {
+  T dropped;
+  Guard guard(lock);
+  std::swap(dropped, field);
+}
+
 // ---------------------------------------------------------------- logging
 
 struct LogEntry {
@@ -109,13 +128,9 @@ class FakeClock : public Clock {
 class FakeRandom : public RandomSource {
  public:
   std::uint32_t uniformBelow(std::uint32_t bound) override {
+    std::uint32_t v = popFront(lock_, script_).value_or(0);
     Guard guard(lock_);
     bounds_.push_back(bound);
-    std::uint32_t v = 0;
-    if (!script_.empty()) {
-      v = script_.front();
-      script_.pop_front();
-    }
     return bound == 0 ? 0 : v % bound;
   }
   void script(std::initializer_list<std::uint32_t> values) {
@@ -141,21 +156,11 @@ class ManualQueue : public SerialQueue {
 
   // Runs the oldest held closure; false when there was none.
   bool runOne() {
-    Task task;
-    {
-      Guard guard(lock_);
-      if (tasks_.empty()) return false;
-      task = std::move(tasks_.front());
-      tasks_.pop_front();
-    }
-    if (task) task();
-    return true;
+    auto task = popFront(lock_, tasks_);
+    if (task && *task) (*task)();
+    return task.has_value();
   }
-  void clear() {
-    std::deque<Task> dropped;  // destroyed outside the lock
-    Guard guard(lock_);
-    dropped.swap(tasks_);
-  }
+  void clear() { dropAll(lock_, tasks_); }
 
  private:
   const std::string label_;
@@ -197,16 +202,10 @@ class ManualDispatcher : public Dispatcher {
   }
   // Runs the held low-priority closures; returns how many ran.
   std::size_t runLowPriority() {
-    for (std::size_t n = 0;; ++n) {
-      Task t;
-      {
-        Guard guard(lock_);
-        if (lowPriority_.empty()) return n;
-        t = std::move(lowPriority_.front());
-        lowPriority_.pop_front();
-      }
-      if (t) t();
-    }
+    std::size_t n = 0;
+    for (std::optional<Task> t; (t = popFront(lock_, lowPriority_)); ++n)
+      if (*t) (*t)();
+    return n;
   }
   void runUntilIdle() {
     do runAll();
@@ -216,11 +215,7 @@ class ManualDispatcher : public Dispatcher {
   std::vector<std::chrono::nanoseconds> lowPriorityDelays() const { return locked(lock_, lowPriorityDelays_); }
   // Drops every held closure without running it.
   void clear() {
-    std::deque<Task> dropped;
-    {
-      Guard guard(lock_);
-      dropped.swap(lowPriority_);
-    }
+    dropAll(lock_, lowPriority_);
     for (auto& q : queues()) q->clear();
   }
 
@@ -268,7 +263,7 @@ struct TelemetryBehaviour {
   BackendAnswer answer = BackendAnswer::List;
   // Answer from a separate thread, as the real service does.
   bool answerOnOwnThread = false;
-  bool refuseSends = false;
+  bool refuseSends = false;  // one-shot sends only
 };
 
 class FakeTelemetrySession : public TelemetrySession {
@@ -296,20 +291,13 @@ class FakeTelemetrySession : public TelemetrySession {
     completion(answer);
   }
   bool sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,
-                   std::optional<Error>* error) override {
+                   std::optional<Error>*) override {
     Guard guard(lock_);
-    if (behaviour_.refuseSends) {
-      if (error) *error = Error{kGeneralErrorDomain, 7, "refused by fake"};
-      return false;
-    }
     sent_.push_back({category, type, payload});
     return true;
   }
   void flushMessages(std::function<void(std::optional<Error>)> completion) override {
-    {
-      Guard guard(lock_);
-      ++flushes_;
-    }
+    { Guard guard(lock_); ++flushes_; }
     if (completion) completion(std::nullopt);
   }
   std::string description() const override { return "<FakeTelemetrySession>"; }
@@ -317,11 +305,7 @@ class FakeTelemetrySession : public TelemetrySession {
   std::vector<SentMessage> sent() const { return locked(lock_, sent_); }
   int flushes() const { return locked(lock_, flushes_); }
   // Drops a completion held by BackendAnswer::Never (it may hold engine objects).
-  void dropHeld() {
-    std::function<void(std::optional<std::vector<std::string>>)> dropped;
-    Guard guard(lock_);
-    dropped.swap(heldCompletion_);
-  }
+  void dropHeld() { dropAll(lock_, heldCompletion_); }
 
  private:
   mutable std::mutex lock_;
@@ -369,9 +353,7 @@ class FakeTelemetryService : public TelemetryService {
     return created_.empty() ? nullptr : created_.back().session;
   }
   std::vector<OneShotMessage> oneShots() const { return locked(lock_, oneShots_); }
-  void dropHeld() {
-    for (auto& c : created()) c.session->dropHeld();
-  }
+  void dropHeld() { for (auto& c : created()) c.session->dropHeld(); }
 
  private:
   mutable std::mutex lock_;
@@ -486,11 +468,7 @@ class FakeNotificationService : public NotificationService {
       if (r.name == name) r.queue->async([handler = r.handler, t = r.token] { handler(t); });
   }
   std::vector<NotificationRegistration> registrations() const { return locked(lock_, registrations_); }
-  void clear() {
-    std::vector<NotificationRegistration> dropped;
-    Guard guard(lock_);
-    dropped.swap(registrations_);
-  }
+  void clear() { dropAll(lock_, registrations_); }
 
  private:
   mutable std::mutex lock_;
