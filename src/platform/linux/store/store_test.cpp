@@ -1,3 +1,5 @@
+#include "platform/linux/store/store.h"
+
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sqlite3.h>
@@ -7,6 +9,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <future>
@@ -14,7 +17,6 @@
 
 #include "platform/linux/store/analytics_service.h"
 #include "platform/linux/store/energy_log_service.h"
-#include "platform/linux/store/store.h"
 #include "platform/linux/store/telemetry_service.h"
 #include "fakes/fake_platform.h"
 #include "platform/linux/system_clock.h"
