@@ -148,11 +148,6 @@ TEST_F(ServiceTest, LookupFollowsRegistryOrderAndOnlyTheOwnerStopsOrDestroys) {
 TEST_F(ServiceTest, DefaultsFollowTheNotification) {
   EXPECT_FALSE(h.delegate->getDefaults().has_value());
   EXPECT_TRUE(h.delegate->isReportingEnabled());
-  auto regs = h.fake.notifications.registrations();
-  ASSERT_EQ(regs.size(), 1u);
-  EXPECT_EQ(regs[0].name, "com.orvane.vireo.reporting");
-  EXPECT_EQ(regs[0].queue, std::static_pointer_cast<SerialQueue>(h.serverQueue()));
-  EXPECT_EQ(h.serverQueue()->qos(), QoS::UserInteractive);
   EXPECT_TRUE(h.fake.logger.contains("notify setup result 0"));
 
   h.postDefaults();
@@ -234,8 +229,6 @@ TEST_F(ServiceTest, UptimeEventAtInvalidation) {
   EXPECT_TRUE(h.delegate->shouldAcceptNewConnection(c));
   EXPECT_TRUE(c.resumed());
   EXPECT_TRUE(h.delegate->getAllClients().empty());
-  EXPECT_TRUE(h.fake.logger.contains("newConnection: <conn 100>"));
-  EXPECT_TRUE(h.fake.logger.contains("new client with pid 100"));
   h.fake.clock.advance(std::chrono::seconds(3));
   const WallTime registeredAt = h.fake.clock.now();
   h.pump();

@@ -464,10 +464,9 @@ class FakeNotificationService : public NotificationService {
   }
   // Queues every handler registered for name on its queue.
   void post(const std::string& name) {
-    for (auto& r : registrations())
+    for (auto& r : locked(lock_, registrations_))
       if (r.name == name) r.queue->async([handler = r.handler, t = r.token] { handler(t); });
   }
-  std::vector<NotificationRegistration> registrations() const { return locked(lock_, registrations_); }
   void clear() { dropAll(lock_, registrations_); }
 
  private:

@@ -57,7 +57,6 @@ struct ServiceHarness {
   FakePlatform fake;
   std::shared_ptr<VRReportingServiceDelegate> delegate = VRReportingServiceDelegate::init(fake.env);
 
-  std::shared_ptr<ManualQueue> serverQueue() const { return fake.dispatcher.queue(kServerQueueLabel); }
   // Runs the server queue (and sessions' queues) until idle; low-priority work stays held.
   void pump() { fake.dispatcher.runAll(); }
 
