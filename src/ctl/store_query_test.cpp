@@ -104,13 +104,11 @@ TEST_F(StoreQueryTest, FiltersAndLimitSelectRowsInOrder) {
   EXPECT_TRUE(rows[0]["session"].is_null());
 }
 
-TEST_F(StoreQueryTest, TextOutputShowsIsoTimes) {
+TEST_F(StoreQueryTest, TextOutputUsageAndMissingStore) {
   std::string text = run("analytics", {"--limit", "1"});
   EXPECT_NE(text.find("at=1970-01-01T00:04:10.000Z"), std::string::npos) << text;
   EXPECT_NE(text.find("payload={\"seconds\":2.5}"), std::string::npos) << text;
-}
-
-TEST_F(StoreQueryTest, UsageAndMissingStore) {
+  // Usage errors, and a store that is not there.
   std::string error;
   EXPECT_FALSE(parseStoreQuery("analytics", {"--session", "1"}, &error));
   EXPECT_FALSE(parseStoreQuery("sessions", {"--since", "soon"}, &error));

@@ -6,7 +6,6 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/prctl.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -103,12 +102,8 @@ class Fake : public VRReportingServiceProtocol, public ListenerDelegate, public 
 class PrivateBus {
  public:
   PrivateBus() {
-    char dirTemplate[] = "/tmp/vireo-bus-test-XXXXXX";
-    dir_ = mkdtemp(dirTemplate);
-    std::string socket = dir_ + "/bus";
-    address_ = "unix:path=" + socket;
-    std::string addressArg = "--address=" + address_;
-    const char* argv[] = {"dbus-daemon", "--session", "--nofork", "--nopidfile", addressArg.c_str(), nullptr};
+    int out[2];
+    if (pipe(out) != 0) return;
     pid_ = fork();
     if (pid_ == 0) {
       // Ends with the test, however the test ends; keeps quiet on the test's output.
@@ -116,27 +111,25 @@ class PrivateBus {
       sigemptyset(&none);
       sigprocmask(SIG_SETMASK, &none, nullptr);  // the suite blocks SIGTERM
       prctl(PR_SET_PDEATHSIG, SIGTERM);
-      int null = open("/dev/null", O_RDWR);
-      dup2(null, STDOUT_FILENO);
-      dup2(null, STDERR_FILENO);
-      execvp("dbus-daemon", const_cast<char**>(argv));
+      dup2(out[1], STDOUT_FILENO);
+      dup2(open("/dev/null", O_WRONLY), STDERR_FILENO);
+      execlp("dbus-daemon", "dbus-daemon", "--session", "--nofork", "--print-address", "--address=unix:tmpdir=/tmp",
+             static_cast<char*>(nullptr));
       _exit(127);
     }
-    struct stat st;
-    eventually([&] { return stat(socket.c_str(), &st) == 0; });
+    close(out[1]);
+    for (char c; read(out[0], &c, 1) == 1 && c != '\n';) address_ += c;
+    close(out[0]);
   }
   ~PrivateBus() {
-    if (pid_ > 0) {
-      kill(pid_, SIGTERM);
-      waitpid(pid_, nullptr, 0);
-    }
-    unlink((dir_ + "/bus").c_str());
-    rmdir(dir_.c_str());
+    if (pid_ <= 0) return;
+    kill(pid_, SIGTERM);
+    waitpid(pid_, nullptr, 0);
   }
   const std::string& address() const { return address_; }
 
  private:
-  std::string dir_, address_;
+  std::string address_;
   pid_t pid_ = -1;
 };
 

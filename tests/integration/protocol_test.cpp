@@ -6,7 +6,7 @@
 
 #include <algorithm>
 
-#include "platform/dbus/value_codec.h"
+#include "platform/dbus/bus.h"
 #include "service_fixture.h"
 
 namespace vireo::itest {
@@ -146,43 +146,6 @@ TEST_F(ProtocolTest, ClientsShareLookupsAndAKilledClientIsRemoved) {
   EXPECT_TRUE(contains(*b->getAllReporters(), 78));
 }
 
-// Raw calls for input the client library would not send.
-class RawBus {
- public:
-  explicit RawBus(const std::string& address) {
-    sd_bus_new(&bus_);
-    sd_bus_set_address(bus_, address.c_str());
-    sd_bus_set_bus_client(bus_, 1);
-    sd_bus_negotiate_fds(bus_, 1);
-    ok_ = sd_bus_start(bus_) >= 0;
-  }
-  ~RawBus() { sd_bus_flush_close_unref(bus_); }
-  bool ok() const { return ok_; }
-  sd_bus_message* call(const char* method) {
-    sd_bus_message* m = nullptr;
-    sd_bus_message_new_method_call(bus_, &m, client::kServiceName, client::kObjectPath, client::kInterface, method);
-    return m;
-  }
-  // The D-Bus error name of the answer, empty on success.
-  std::string send(sd_bus_message* m) {
-    sd_bus_error e = SD_BUS_ERROR_NULL;
-    sd_bus_message* reply = nullptr;
-    int r = sd_bus_call(bus_, m, 10'000'000, &e, &reply);
-    std::string name = r < 0 ? (e.name ? e.name : "failed") : "";
-    message_ = e.message ? e.message : "";
-    sd_bus_error_free(&e);
-    sd_bus_message_unref(reply);
-    sd_bus_message_unref(m);
-    return name;
-  }
-  const std::string& lastMessage() const { return message_; }
-
- private:
-  sd_bus* bus_ = nullptr;
-  bool ok_ = false;
-  std::string message_;
-};
-
 Dictionary nestedPayload(int containers) {
   // The payload itself is the first container.
   Value v("leaf");
@@ -191,27 +154,32 @@ Dictionary nestedPayload(int containers) {
 }
 
 TEST_F(ProtocolTest, BadInputIsRefusedUntilKillService) {
-  RawBus raw(busAddress_);
-  ASSERT_TRUE(raw.ok());
+  // Raw calls for input the client library would not send.
+  dbus::BusRef raw;
+  ASSERT_GE(sd_bus_new(raw.out()), 0);
+  sd_bus_set_address(raw.get(), busAddress_.c_str());
+  sd_bus_set_bus_client(raw.get(), 1);
+  sd_bus_negotiate_fds(raw.get(), 1);
+  ASSERT_GE(sd_bus_start(raw.get()), 0);
+  auto call = [&](const char* method, auto&& append) {
+    dbus::MessageRef m, reply;
+    sd_bus_message_new_method_call(raw.get(), m.out(), client::kServiceName, client::kObjectPath, client::kInterface,
+                                   method);
+    append(m.get());
+    dbus::BusError e;
+    sd_bus_call(raw.get(), m.get(), 10'000'000, e.get(), reply.out());
+    return std::string(e.name());
+  };
   constexpr const char* kInvalidArgs = "org.freedesktop.DBus.Error.InvalidArgs";
-
-  sd_bus_message* m = raw.call("CreateReportingSession");
-  sd_bus_message_append(m, "s", "not a number");
-  EXPECT_FALSE(raw.send(m).empty());
-
-  m = raw.call("NoSuchMethod");
-  EXPECT_EQ(raw.send(m), "org.freedesktop.DBus.Error.UnknownMethod");
-
+  EXPECT_EQ(call("CreateReportingSession", [](sd_bus_message* m) { sd_bus_message_append(m, "s", "not a number"); }),
+            kInvalidArgs);
+  EXPECT_EQ(call("NoSuchMethod", [](sd_bus_message*) {}), "org.freedesktop.DBus.Error.UnknownMethod");
   // A file descriptor inside the payload.
-  m = raw.call("SendMessage");
-  sd_bus_message_open_container(m, 'a', "{sv}");
-  sd_bus_message_open_container(m, 'e', "sv");
-  sd_bus_message_append_basic(m, 's', "fd");
-  sd_bus_message_append(m, "v", "h", STDERR_FILENO);
-  sd_bus_message_close_container(m);
-  sd_bus_message_close_container(m);
-  sd_bus_message_append(m, "uqbax", 3u, 1, 0, 0);
-  EXPECT_EQ(raw.send(m), kInvalidArgs);
+  EXPECT_EQ(call("SendMessage",
+                 [](sd_bus_message* m) {
+                   sd_bus_message_append(m, "a{sv}uqbax", 1, "fd", "h", STDERR_FILENO, 3u, 1, 0, 0);
+                 }),
+            kInvalidArgs);
 
   auto c = connect();
   ASSERT_TRUE(c);
