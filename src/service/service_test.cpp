@@ -66,6 +66,27 @@ TEST_F(ServiceTest, QueriesAnswerTwiceForIDZeroAndWithBusKinds) {
   EXPECT_EQ(none[1].second.toInt64(), 0xFFFF);
 }
 
+TEST_F(ServiceTest, OperationsEmitTheirTraceCodesOncePerCall) {
+  auto c = h.connect(100, "player");
+  create(*c, 5);
+  start(*c, 5);
+  c->client().stopReportingSessionForID(5, nullptr);
+  c->client().destroyReportingSession(5, nullptr);
+  // Operations on ID 0 still trace; queries never do.
+  c->client().stopReportingSessionForID(0, nullptr);
+  c->client().getServiceNameForReporterID(5, nullptr);
+  c->client().reporterIDValid(5, nullptr);
+  h.pump();
+  const auto& tracer = h.fake.tracer;
+  EXPECT_EQ(tracer.count(trace::kServerCreate), 1u);
+  EXPECT_EQ(tracer.count(trace::kServerStart), 1u);
+  EXPECT_EQ(tracer.count(trace::kServerStop), 2u);
+  EXPECT_EQ(tracer.count(trace::kServerDestroy), 1u);
+  EXPECT_EQ(tracer.count(trace::kSessionCreate), 1u);
+  EXPECT_EQ(tracer.count(trace::kSessionStart), 1u);
+  EXPECT_EQ(tracer.count(trace::kSessionStop), 1u);
+}
+
 TEST_F(ServiceTest, CreateUnderAnExistingIDReplacesWithoutStoppingAndKeepsItsPlace) {
   auto c = h.connect(100, "player");
   create(*c, 5);
