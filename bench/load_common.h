@@ -16,7 +16,10 @@
 #include <mutex>
 #include <optional>
 #include <sstream>
+#include <memory>
 #include <string>
+
+#include "vireo/client.h"
 
 namespace vireo::bench {
 
@@ -138,6 +141,17 @@ class StartGate {
 
 inline double secondsSince(std::chrono::steady_clock::time_point t) {
   return std::chrono::duration<double>(std::chrono::steady_clock::now() - t).count();
+}
+
+// A client of the daemon on the given bus address (the default bus when empty); a
+// load tool cannot go on without one.
+inline std::unique_ptr<client::Client> connectClient(const std::string& address) {
+  auto c = address.empty() ? client::Client::connect() : client::Client::connectAddress(address);
+  if (!c) {
+    std::fprintf(stderr, "cannot connect: %s\n", c.error().message.c_str());
+    std::exit(1);
+  }
+  return std::move(*c);
 }
 
 }  // namespace vireo::bench

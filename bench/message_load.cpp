@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "load_common.h"
+#include "platform/dbus/send_message_arguments.h"
 #include "platform/dbus/value_codec.h"
 #include "platform/linux/paths.h"
 #include "vireo/client.h"
@@ -138,17 +139,9 @@ class DiscardServer {
 
  private:
   static int discard(sd_bus_message* m, void*, sd_bus_error* error) {
-    Dictionary payload;
-    int r = dbus::readDictionary(m, &payload, error);
-    if (r < 0) return r;
-    std::uint32_t category = 0;
-    std::uint16_t type = 0;
-    int addressed = 0;
-    if ((r = sd_bus_message_read(m, "uqb", &category, &type, &addressed)) < 0) return r;
-    const void* ids = nullptr;
-    size_t size = 0;
-    if ((r = sd_bus_message_read_array(m, 'x', &ids, &size)) < 0) return r;
-    return sd_bus_reply_method_return(m, "");
+    dbus::SendMessageArguments args;
+    int r = dbus::readSendMessageArguments(m, &args, error);
+    return r < 0 ? r : sd_bus_reply_method_return(m, "");
   }
   static constexpr sd_bus_vtable kVtable[] = {
       SD_BUS_VTABLE_START(0),
@@ -254,14 +247,6 @@ Row runPhase(const std::string& what, const std::string& mode, std::vector<sd_bu
   return row;
 }
 
-std::unique_ptr<client::Client> connectClient(const std::string& address) {
-  auto c = address.empty() ? client::Client::connect() : client::Client::connectAddress(address);
-  if (!c) {
-    std::fprintf(stderr, "cannot connect: %s\n", c.error().message.c_str());
-    std::exit(1);
-  }
-  return std::move(*c);
-}
 
 }  // namespace
 
@@ -284,7 +269,7 @@ int main(int argc, char** argv) {
     return 1;
   }
   // The store is opened after the daemon made it.
-  auto setup = connectClient(address);
+  auto setup = bench::connectClient(address);
   if (auto p = setup->ping(); !p) {
     std::fprintf(stderr, "the daemon does not answer: %s\n", p.error().message.c_str());
     return 1;
@@ -300,7 +285,7 @@ int main(int argc, char** argv) {
   // Session owners: one client connection per sender, IDs unique to this run.
   const std::int64_t base = static_cast<std::int64_t>(getpid()) << 24;
   std::vector<std::unique_ptr<client::Client>> owners;
-  for (size_t i = 0; i < clients; ++i) owners.push_back(connectClient(address));
+  for (size_t i = 0; i < clients; ++i) owners.push_back(bench::connectClient(address));
   auto startSessions = [&](size_t howMany) {
     std::vector<client::StartHandle> handles;
     for (size_t i = 0; i < howMany; ++i) {

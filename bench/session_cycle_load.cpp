@@ -28,14 +28,6 @@ struct Phase {
   double rate() const { return seconds > 0 ? static_cast<double>(calls) / seconds : 0; }
 };
 
-std::unique_ptr<client::Client> connectClient(const std::string& address) {
-  auto c = address.empty() ? client::Client::connect() : client::Client::connectAddress(address);
-  if (!c) {
-    std::fprintf(stderr, "cannot connect: %s\n", c.error().message.c_str());
-    std::exit(1);
-  }
-  return std::move(*c);
-}
 
 // Runs body(client, index, stop) on every client at once; returns the wall time.
 template <class Body>
@@ -63,7 +55,7 @@ int main(int argc, char** argv) {
   const std::string address = opt.text("address", "");
 
   std::vector<std::unique_ptr<client::Client>> clients;
-  for (size_t i = 0; i < clientsCount; ++i) clients.push_back(connectClient(address));
+  for (size_t i = 0; i < clientsCount; ++i) clients.push_back(bench::connectClient(address));
   if (auto p = clients[0]->ping(); !p) {
     std::fprintf(stderr, "the daemon does not answer: %s\n", p.error().message.c_str());
     return 1;

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "daemon/pending_call.h"
+#include "platform/dbus/send_message_arguments.h"
 #include "platform/dbus/value_codec.h"
 #include "platform/error.h"
 #include "service/reporting_protocol.h"
@@ -169,24 +170,11 @@ struct BusServiceAccess {
 
   static int sendMessage(sd_bus_message* m, void* userdata, sd_bus_error* error) {
     return guarded(error, [&] {
-      Dictionary payload;
-      int r = dbus::readDictionary(m, &payload, error);
+      dbus::SendMessageArguments args;
+      int r = dbus::readSendMessageArguments(m, &args, error);
       if (r < 0) return r;
-      std::uint32_t category = 0;
-      std::uint16_t type = 0;
-      int addressed = 0;
-      if ((r = sd_bus_message_read(m, "uqb", &category, &type, &addressed)) < 0) return r;
-      const void* ids = nullptr;
-      std::size_t size = 0;
-      if ((r = sd_bus_message_read_array(m, 'x', &ids, &size)) < 0) return r;
-      std::optional<std::vector<std::int64_t>> list;
-      if (addressed) {
-        list.emplace(size / sizeof(std::int64_t));
-        if (size) std::memcpy(list->data(), ids, size);
-      }
-      self(userdata).submit(m, [payload = std::move(payload), category, type, list = std::move(list)](auto& object,
-                                                                                                       auto& p) {
-        object.sendMessage(payload, category, type, list,
+      self(userdata).submit(m, [args = std::move(args)](auto& object, auto& p) {
+        object.sendMessage(args.payload, args.category, args.type, args.reporterIDs,
                            [p](std::optional<Error> e) { p->answer(errorReply(e)); });
       });
       return 1;

@@ -328,9 +328,10 @@ int readDictionary(sd_bus_message* m, Dictionary* out, sd_bus_error* error) {
   Value v;
   int r = readValue(m, &v, error);
   if (r < 0) return r;
-  const Dictionary* dict = r > 0 ? v.asDictionary() : nullptr;
+  // The freshly read value is the container's only owner: moving it out copies nothing.
+  Dictionary* dict = r > 0 ? v.mutableDictionary() : nullptr;
   if (!dict) return sd_bus_error_set(error, kInvalidArgs, "expected a dictionary");
-  *out = *dict;
+  *out = std::move(*dict);
   return 1;
 }
 
