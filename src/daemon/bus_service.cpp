@@ -173,8 +173,9 @@ struct BusServiceAccess {
       dbus::SendMessageArguments args;
       int r = dbus::readSendMessageArguments(m, &args, error);
       if (r < 0) return r;
-      self(userdata).submit(m, [args = std::move(args)](auto& object, auto& p) {
-        object.sendMessage(args.payload, args.category, args.type, args.reporterIDs,
+      // Each submitted operation runs once, so its arguments are moved on, not copied.
+      self(userdata).submit(m, [args = std::move(args)](auto& object, auto& p) mutable {
+        object.sendMessage(std::move(args.payload), args.category, args.type, std::move(args.reporterIDs),
                            [p](std::optional<Error> e) { p->answer(errorReply(e)); });
       });
       return 1;
