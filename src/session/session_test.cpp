@@ -271,7 +271,7 @@ TEST_F(SessionTest, SingleMessageDelayNamesAndRefusal) {
   EXPECT_TRUE(p.logger.contains("category 1073741832 : type 4"));
   EXPECT_TRUE(p.logger.contains("\"a b\""));
 
-  p.telemetry.setRefuseSends(true);
+  p.telemetry.setBehaviour({BackendAnswer::List, false, true});
   std::optional<std::optional<Error>> got;
   VRReportingSession::sendSingleMessage(p.env, Dictionary{}, 1, 0, 0, nullptr,
                                         [&](std::optional<Error> e) { got = e; });

@@ -1,13 +1,9 @@
-// Recording fakes of every platform interface, and FakePlatform, which owns one of
-// each and hands them out as a Platform bundle and a ReportingEnvironment.
-//
-// Everything is deterministic: queued closures run only when a test asks
-// (ManualDispatcher), time moves only when a test moves it, random numbers are
-// scripted, and nothing touches the file system. Each fake's lock guards all of its
-// fields: the thread tests share the fakes between pool threads.
+// Recording fakes of every platform interface, bundled by FakePlatform. Deterministic: queued closures
+// run and time moves only when a test asks, random numbers are scripted, no file is touched.
 #pragma once
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <deque>
@@ -28,56 +24,63 @@
 
 namespace vireo::testing {
 
-using Guard = std::lock_guard<std::mutex>;
-
-// A copy of a field, taken under the lock that guards it.
+// A value and the lock that guards it (the thread tests share the fakes between pool threads).
+// with() runs f on the value under the lock; a Locked member called as a function returns a copy.
 template <typename T>
-T locked(std::mutex& lock, const T& field) {
-  Guard guard(lock);
-  return field;
-}
+class Locked {
+ public:
+  Locked() = default;
+  explicit Locked(T value) : value_(std::move(value)) {}
+  template <typename F>
+  auto with(F&& f) const {
+    std::lock_guard guard(lock_);
+    return f(value_);
+  }
+  T get() const { return with([](T& v) { return v; }); }
+  T operator()() const { return get(); }
+  // The old value (closures that may own engine objects) dies after the lock is released.
+  void set(T value) { with([&](T& old) { std::swap(old, value); }); }
 
-// Takes the oldest item out under the lock; nullopt when there is none.
-template <typename T>
-std::optional<T> popFront(std::mutex& lock, std::deque<T>& items) {
-  Guard guard(lock);
-  if (items.empty()) return std::nullopt;
-  T item = std::move(items.front());
-  items.pop_front();
-  return item;
-}
-
-// Empties a field under the lock; the old contents (closures that may own engine
-// objects) are destroyed after it is released.
-template <typename T>
-void dropAll(std::mutex& lock, T& field) {
-  T dropped;
-  Guard guard(lock);
-  std::swap(dropped, field);
-}
-
-// ---------------------------------------------------------------- logging
-
-struct LogEntry {
-  LogScope scope;
-  LogLevel level;
-  std::string function;
-  std::string message;
+ private:
+  mutable std::mutex lock_;
+  mutable T value_{};
 };
 
-class RecordingLogger : public Logger {
- public:
-  bool verbose(LogScope scope) const override { Guard guard(lock_); return verbose_.count(scope) != 0; }
+// The calls a fake received, in order.
+template <typename T>
+struct Recorder : Locked<std::vector<T>> {
+  void add(T item) { this->with([&](std::vector<T>& v) { v.push_back(std::move(item)); }); }
+};
+
+template <typename T>
+std::optional<T> popFront(Locked<std::deque<T>>& items) {
+  return items.with([](std::deque<T>& d) -> std::optional<T> {
+    if (d.empty()) return std::nullopt;
+    T item = std::move(d.front());
+    d.pop_front();
+    return item;
+  });
+}
+
+template <typename M>
+std::optional<typename M::mapped_type> lookup(const Locked<M>& map, const typename M::key_type& key) {
+  return map.with([&](M& m) -> std::optional<typename M::mapped_type> {
+    auto it = m.find(key);
+    return it == m.end() ? std::nullopt : std::optional(it->second);
+  });
+}
+
+struct LogEntry { LogScope scope; LogLevel level; std::string function, message; };
+
+struct RecordingLogger : Logger {
+  bool verbose(LogScope scope) const override { return verbose_.with([&](auto& s) { return s.count(scope) != 0; }); }
   void write(LogScope scope, LogLevel level, const char*, int, const char* function,
              std::string_view message) override {
-    Guard guard(lock_);
-    entries_.push_back({scope, level, function ? function : "", std::string(message)});
+    entries.add({scope, level, function ? function : "", std::string(message)});
   }
   void setVerbose(LogScope scope, bool on) {
-    Guard guard(lock_);
-    on ? (void)verbose_.insert(scope) : (void)verbose_.erase(scope);
+    verbose_.with([&](auto& s) { on ? (void)s.insert(scope) : (void)s.erase(scope); });
   }
-  std::vector<LogEntry> entries() const { return locked(lock_, entries_); }
   // Entries whose message contains text.
   std::vector<LogEntry> matching(std::string_view text) const {
     std::vector<LogEntry> out;
@@ -88,85 +91,60 @@ class RecordingLogger : public Logger {
   bool contains(std::string_view text) const { return count(text) > 0; }
   std::size_t count(std::string_view text) const { return matching(text).size(); }
   std::size_t size() const { return entries().size(); }
-  void clear() { Guard guard(lock_); entries_.clear(); }
-
- private:
-  mutable std::mutex lock_;
-  std::vector<LogEntry> entries_;
-  std::set<LogScope> verbose_;
+  void clear() { entries.set({}); }
+  Recorder<LogEntry> entries;
+  Locked<std::set<LogScope>> verbose_;
 };
 
-class RecordingTracer : public Tracer {
- public:
-  void emit(std::uint32_t code) override { Guard guard(lock_); codes_.push_back(code); }
+struct RecordingTracer : Tracer {
+  void emit(std::uint32_t code) override { codes.add(code); }
   std::size_t count(std::uint32_t code) const {
-    Guard guard(lock_);
-    return static_cast<std::size_t>(std::count(codes_.begin(), codes_.end(), code));
+    auto all = codes();
+    return static_cast<std::size_t>(std::count(all.begin(), all.end(), code));
   }
-
- private:
-  mutable std::mutex lock_;
-  std::vector<std::uint32_t> codes_;
+  Recorder<std::uint32_t> codes;
 };
 
-// ---------------------------------------------------------------- time and chance
-
-class FakeClock : public Clock {
- public:
-  WallTime now() const override { return locked(lock_, now_); }
+struct FakeClock : Clock {
+  WallTime now() const override { return now_.get(); }
   void advance(std::chrono::nanoseconds d) {
-    Guard guard(lock_);
-    now_ += std::chrono::duration_cast<WallTime::duration>(d);
+    now_.with([&](WallTime& t) { t += std::chrono::duration_cast<WallTime::duration>(d); });
   }
-
- private:
-  mutable std::mutex lock_;
-  WallTime now_ = WallTime(std::chrono::seconds(1'700'000'000));
+  Locked<WallTime> now_{WallTime(std::chrono::seconds(1'700'000'000))};
 };
 
 // Returns the scripted values in order (each reduced below the bound), then 0.
-class FakeRandom : public RandomSource {
- public:
+struct FakeRandom : RandomSource {
   std::uint32_t uniformBelow(std::uint32_t bound) override {
-    std::uint32_t v = popFront(lock_, script_).value_or(0);
-    Guard guard(lock_);
-    bounds_.push_back(bound);
+    boundsAsked.add(bound);
+    std::uint32_t v = popFront(script_).value_or(0);
     return bound == 0 ? 0 : v % bound;
   }
   void script(std::initializer_list<std::uint32_t> values) {
-    Guard guard(lock_);
-    script_.insert(script_.end(), values.begin(), values.end());
+    script_.with([&](auto& s) { s.insert(s.end(), values); });
   }
-  std::vector<std::uint32_t> boundsAsked() const { return locked(lock_, bounds_); }
-
- private:
-  mutable std::mutex lock_;
-  std::deque<std::uint32_t> script_;
-  std::vector<std::uint32_t> bounds_;
+  Recorder<std::uint32_t> boundsAsked;
+  Locked<std::deque<std::uint32_t>> script_;
 };
-
-// ---------------------------------------------------------------- dispatch
 
 class ManualQueue : public SerialQueue {
  public:
   ManualQueue(std::string label, QoS qos) : label_(std::move(label)), qos_(qos) {}
-  void async(Task task) override { Guard guard(lock_); tasks_.push_back(std::move(task)); }
+  void async(Task task) override { tasks_.with([&](auto& t) { t.push_back(std::move(task)); }); }
   const std::string& label() const override { return label_; }
   QoS qos() const { return qos_; }
-
   // Runs the oldest held closure; false when there was none.
   bool runOne() {
-    auto task = popFront(lock_, tasks_);
+    auto task = popFront(tasks_);
     if (task && *task) (*task)();
     return task.has_value();
   }
-  void clear() { dropAll(lock_, tasks_); }
+  void clear() { tasks_.set({}); }
 
  private:
   const std::string label_;
   const QoS qos_;
-  mutable std::mutex lock_;
-  std::deque<Task> tasks_;
+  Locked<std::deque<Task>> tasks_;
 };
 
 // Holds every submitted closure until the test runs it, on the test's thread;
@@ -174,17 +152,14 @@ class ManualQueue : public SerialQueue {
 class ManualDispatcher : public Dispatcher {
  public:
   ~ManualDispatcher() override { clear(); }
-
   std::shared_ptr<SerialQueue> makeSerialQueue(std::string label, QoS qos) override {
     auto q = std::make_shared<ManualQueue>(std::move(label), qos);
-    Guard guard(lock_);
-    queues_.push_back(q);
+    queues_.add(q);
     return q;
   }
   void asyncLowPriority(std::chrono::nanoseconds delay, Task task) override {
-    Guard guard(lock_);
-    lowPriorityDelays_.push_back(delay);
-    lowPriority_.push_back(std::move(task));
+    lowPriorityDelays.add(delay);
+    lowPriority_.with([&](auto& l) { l.push_back(std::move(task)); });
   }
 
   std::shared_ptr<ManualQueue> queue(std::string_view label) const {
@@ -203,231 +178,151 @@ class ManualDispatcher : public Dispatcher {
   // Runs the held low-priority closures; returns how many ran.
   std::size_t runLowPriority() {
     std::size_t n = 0;
-    for (std::optional<Task> t; (t = popFront(lock_, lowPriority_)); ++n)
+    for (std::optional<Task> t; (t = popFront(lowPriority_)); ++n)
       if (*t) (*t)();
     return n;
   }
   void runUntilIdle() {
-    do runAll();
-    while (runLowPriority() != 0);
+    while (runAll(), runLowPriority() != 0) {
+    }
   }
-  std::size_t pendingLowPriority() const { Guard guard(lock_); return lowPriority_.size(); }
-  std::vector<std::chrono::nanoseconds> lowPriorityDelays() const { return locked(lock_, lowPriorityDelays_); }
+  std::size_t pendingLowPriority() const { return lowPriority_.with([](auto& l) { return l.size(); }); }
+  Recorder<std::chrono::nanoseconds> lowPriorityDelays;
   // Drops every held closure without running it.
   void clear() {
-    dropAll(lock_, lowPriority_);
+    lowPriority_.set({});
     for (auto& q : queues()) q->clear();
   }
 
  private:
   std::vector<std::shared_ptr<ManualQueue>> queues() const {
-    Guard guard(lock_);
     std::vector<std::shared_ptr<ManualQueue>> out;
-    for (const auto& w : queues_)
+    for (const auto& w : queues_.get())
       if (auto q = w.lock()) out.push_back(q);
     return out;
   }
 
-  mutable std::mutex lock_;
   // Weak: a queue lives as long as its owner; the dispatcher only needs to find it.
-  std::vector<std::weak_ptr<ManualQueue>> queues_;
-  std::deque<Task> lowPriority_;
-  std::vector<std::chrono::nanoseconds> lowPriorityDelays_;
+  Recorder<std::weak_ptr<ManualQueue>> queues_;
+  Locked<std::deque<Task>> lowPriority_;
 };
 
-// ---------------------------------------------------------------- telemetry
+struct SentMessage { std::uint16_t category = 0, type = 0; Dictionary payload; };
+struct OneShotMessage : SentMessage { Dictionary sessionInfo, userInfo; };
 
-struct SentMessage {
-  std::uint16_t category = 0;
-  std::uint16_t type = 0;
-  Dictionary payload;
-};
+// How a telemetry session answers startConfiguration: with a list of backends, an
+// empty list, no list at all, or never (the completion is kept).
+enum class BackendAnswer { List, EmptyList, Nothing, Never };
 
-struct OneShotMessage {
-  Dictionary sessionInfo;
-  Dictionary userInfo;
-  std::uint16_t category = 0;
-  std::uint16_t type = 0;
-  Dictionary payload;
-};
-
-// How a telemetry session answers startConfiguration.
-enum class BackendAnswer {
-  List,       // the configured backends
-  EmptyList,  // an empty list
-  Nothing,    // no list at all
-  Never,      // the completion is kept and never called
-};
-
-struct TelemetryBehaviour {
-  BackendAnswer answer = BackendAnswer::List;
-  // Answer from a separate thread, as the real service does.
-  bool answerOnOwnThread = false;
-  bool refuseSends = false;  // one-shot sends only
-};
+// Answering on its own thread is what the real service does; refusal applies to one-shot sends.
+struct TelemetryBehaviour { BackendAnswer answer = BackendAnswer::List; bool answerOnOwnThread = false, refuseSends = false; };
 
 class FakeTelemetrySession : public TelemetrySession {
  public:
+  using Completion = std::function<void(std::optional<std::vector<std::string>>)>;
   explicit FakeTelemetrySession(TelemetryBehaviour behaviour) : behaviour_(behaviour) {}
-  ~FakeTelemetrySession() override {
-    if (answerThread_.joinable()) answerThread_.join();
-  }
+  ~FakeTelemetrySession() override { if (answerThread_.joinable()) answerThread_.join(); }
 
-  void startConfiguration(std::function<void(std::optional<std::vector<std::string>>)> completion) override {
+  void startConfiguration(Completion completion) override {
     std::optional<std::vector<std::string>> answer;
-    {
-      Guard guard(lock_);
-      switch (behaviour_.answer) {
-        case BackendAnswer::List: answer = std::vector<std::string>{"backend-1"}; break;
-        case BackendAnswer::EmptyList: answer = std::vector<std::string>{}; break;
-        case BackendAnswer::Nothing: break;
-        case BackendAnswer::Never: heldCompletion_ = std::move(completion); return;
-      }
-      if (behaviour_.answerOnOwnThread) {
-        answerThread_ = std::thread([completion = std::move(completion), answer] { completion(answer); });
-        return;
-      }
-    }
-    completion(answer);
+    if (behaviour_.answer == BackendAnswer::List) answer = std::vector<std::string>{"backend-1"};
+    if (behaviour_.answer == BackendAnswer::EmptyList) answer.emplace();
+    if (behaviour_.answer == BackendAnswer::Never) return held_.set(std::move(completion));
+    if (!behaviour_.answerOnOwnThread) return completion(answer);
+    answerThread_ = std::thread([completion = std::move(completion), answer] { completion(answer); });
   }
   bool sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,
                    std::optional<Error>*) override {
-    Guard guard(lock_);
-    sent_.push_back({category, type, payload});
+    sent.add({category, type, payload});
     return true;
   }
   void flushMessages(std::function<void(std::optional<Error>)> completion) override {
-    { Guard guard(lock_); ++flushes_; }
+    ++flushes_;
     if (completion) completion(std::nullopt);
   }
   std::string description() const override { return "<FakeTelemetrySession>"; }
 
-  std::vector<SentMessage> sent() const { return locked(lock_, sent_); }
-  int flushes() const { return locked(lock_, flushes_); }
+  int flushes() const { return flushes_; }
   // Drops a completion held by BackendAnswer::Never (it may hold engine objects).
-  void dropHeld() { dropAll(lock_, heldCompletion_); }
+  void dropHeld() { held_.set(nullptr); }
+  Recorder<SentMessage> sent;
 
  private:
-  mutable std::mutex lock_;
-  TelemetryBehaviour behaviour_;
-  std::vector<SentMessage> sent_;
-  int flushes_ = 0;
-  std::function<void(std::optional<std::vector<std::string>>)> heldCompletion_;
-  std::thread answerThread_;
+  const TelemetryBehaviour behaviour_;
+  std::atomic<int> flushes_{0};
+  Locked<Completion> held_;
+  std::thread answerThread_;  // set by the one startConfiguration call, joined on destruction
 };
 
-struct CreatedSession {
-  Dictionary sessionInfo;
-  Dictionary userInfo;
-  std::shared_ptr<FakeTelemetrySession> session;
-};
+struct CreatedSession { Dictionary sessionInfo, userInfo; std::shared_ptr<FakeTelemetrySession> session; };
 
 class FakeTelemetryService : public TelemetryService {
  public:
   // Applies to sessions created and one-shot sends made from now on.
-  void setBehaviour(TelemetryBehaviour behaviour) { Guard guard(lock_); behaviour_ = behaviour; }
-  void setRefuseSends(bool refuse) { Guard guard(lock_); behaviour_.refuseSends = refuse; }
+  void setBehaviour(TelemetryBehaviour behaviour) { behaviour_.set(behaviour); }
 
   std::shared_ptr<HierarchyToken> makeHierarchyToken() override {
-    Guard guard(lock_);
     return std::make_shared<HierarchyToken>(HierarchyToken{"token-" + std::to_string(++tokens_)});
   }
   std::shared_ptr<TelemetrySession> createSession(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                                   const std::vector<std::string>&) override {
-    Guard guard(lock_);
-    auto s = std::make_shared<FakeTelemetrySession>(behaviour_);
-    created_.push_back({sessionInfo, userInfo, s});
+    auto s = std::make_shared<FakeTelemetrySession>(behaviour_.get());
+    created.add({sessionInfo, userInfo, s});
     return s;
   }
   bool sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo, std::uint16_t category,
                       std::uint16_t type, const Dictionary& payload, std::optional<Error>* error) override {
-    Guard guard(lock_);
-    oneShots_.push_back({sessionInfo, userInfo, category, type, payload});
-    if (behaviour_.refuseSends && error) *error = Error{kGeneralErrorDomain, 7, "refused by fake"};
-    return !behaviour_.refuseSends;
+    oneShots.add({{category, type, payload}, sessionInfo, userInfo});
+    if (!behaviour_.get().refuseSends) return true;
+    if (error) *error = Error{kGeneralErrorDomain, 7, "refused by fake"};
+    return false;
   }
 
-  std::vector<CreatedSession> created() const { return locked(lock_, created_); }
   std::shared_ptr<FakeTelemetrySession> lastSession() const {
-    Guard guard(lock_);
-    return created_.empty() ? nullptr : created_.back().session;
+    auto all = created();
+    return all.empty() ? nullptr : all.back().session;
   }
-  std::vector<OneShotMessage> oneShots() const { return locked(lock_, oneShots_); }
-  void dropHeld() { for (auto& c : created()) c.session->dropHeld(); }
+  void dropHeld() {
+    for (auto& c : created()) c.session->dropHeld();
+  }
+  Recorder<CreatedSession> created;
+  Recorder<OneShotMessage> oneShots;
 
  private:
-  mutable std::mutex lock_;
-  TelemetryBehaviour behaviour_;
-  int tokens_ = 0;
-  std::vector<CreatedSession> created_;
-  std::vector<OneShotMessage> oneShots_;
+  Locked<TelemetryBehaviour> behaviour_;
+  std::atomic<int> tokens_{0};
 };
 
-// ---------------------------------------------------------------- event sinks
+struct AnalyticsEvent { std::string name; Dictionary payload; };
 
-struct AnalyticsEvent {
-  std::string name;
-  Dictionary payload;
-};
-
-class FakeAnalyticsService : public AnalyticsService {
- public:
+struct FakeAnalyticsService : AnalyticsService {
   void sendEventLazy(std::string_view name, const std::function<Dictionary()>& payload) override {
     if (onCall) onCall();
-    {
-      Guard guard(lock_);
-      if (unwanted_.count(std::string(name))) {
-        skipped_.emplace_back(name);
-        return;
-      }
-    }
-    Dictionary d = payload ? payload() : Dictionary{};  // built outside the lock
-    Guard guard(lock_);
-    events_.push_back({std::string(name), std::move(d)});
+    if (unwanted_.with([&](auto& u) { return u.count(std::string(name)) != 0; })) return skipped.add(std::string(name));
+    events.add({std::string(name), payload ? payload() : Dictionary{}});  // built outside the lock
   }
   // Events of this name are not wanted: their payload is never built.
-  void addUnwanted(std::string name) { Guard guard(lock_); unwanted_.insert(std::move(name)); }
-  std::vector<AnalyticsEvent> events() const { return locked(lock_, events_); }
-  std::vector<std::string> skipped() const { return locked(lock_, skipped_); }
+  void addUnwanted(std::string name) { unwanted_.with([&](auto& u) { u.insert(std::move(name)); }); }
   std::function<void()> onCall;  // runs first in every call; set before any thread runs
-
- private:
-  mutable std::mutex lock_;
-  std::set<std::string> unwanted_;
-  std::vector<AnalyticsEvent> events_;
-  std::vector<std::string> skipped_;
+  Recorder<AnalyticsEvent> events;
+  Recorder<std::string> skipped;
+  Locked<std::set<std::string>> unwanted_;
 };
 
-struct EnergyEvent {
-  int client = 0;
-  std::string name;
-  Dictionary event;
-};
+struct EnergyEvent { int client = 0; std::string name; Dictionary event; };
 
-class FakeEnergyLogService : public EnergyLogService {
- public:
+struct FakeEnergyLogService : EnergyLogService {
   void logEvent(int client, std::string_view name, const Dictionary& event) override {
     if (onCall) onCall();
-    Guard guard(lock_);
-    events_.push_back({client, std::string(name), event});
+    events.add({client, std::string(name), event});
   }
-  std::vector<EnergyEvent> events() const { return locked(lock_, events_); }
   std::function<void()> onCall;  // runs first in every call; set before any thread runs
-
- private:
-  mutable std::mutex lock_;
-  std::vector<EnergyEvent> events_;
+  Recorder<EnergyEvent> events;
 };
 
-// ---------------------------------------------------------------- defaults
-
-class FakeDefaultsStore : public DefaultsStore {
- public:
+struct FakeDefaultsStore : DefaultsStore {
   std::optional<std::string> stringForKey(std::string_view suite, std::string_view key) override {
-    Guard guard(lock_);
-    auto it = values_.find({std::string(suite), std::string(key)});
-    if (it == values_.end()) return std::nullopt;
-    return it->second;
+    return lookup(values_, {std::string(suite), std::string(key)});
   }
   // The tests only set lower-case booleans.
   bool boolForKey(std::string_view suite, std::string_view key) override {
@@ -435,117 +330,82 @@ class FakeDefaultsStore : public DefaultsStore {
     return v == "1" || v == "yes" || v == "true" || v == "on";
   }
   void set(std::string suite, std::string key, std::string value) {
-    Guard guard(lock_);
-    values_[{std::move(suite), std::move(key)}] = std::move(value);
+    values_.with([&](auto& v) { v[{std::move(suite), std::move(key)}] = std::move(value); });
   }
-  void remove(const std::string& suite, const std::string& key) { Guard guard(lock_); values_.erase({suite, key}); }
-
- private:
-  mutable std::mutex lock_;
-  std::map<std::pair<std::string, std::string>, std::string> values_;
+  void remove(const std::string& suite, const std::string& key) { values_.with([&](auto& v) { v.erase({suite, key}); }); }
+  Locked<std::map<std::pair<std::string, std::string>, std::string>> values_;
 };
 
-struct NotificationRegistration {
-  std::string name;
-  std::shared_ptr<SerialQueue> queue;
-  std::function<void(int)> handler;
-  int token = 0;
-};
-
-class FakeNotificationService : public NotificationService {
- public:
+struct FakeNotificationService : NotificationService {
   int registerDispatch(std::string name, std::shared_ptr<SerialQueue> queue, std::function<void(int)> handler,
                        int* token) override {
-    Guard guard(lock_);
-    int t = static_cast<int>(registrations_.size()) + 1;
+    int t = registrations_.with([&](auto& r) {
+      r.push_back({std::move(name), std::move(queue), std::move(handler), static_cast<int>(r.size()) + 1});
+      return r.back().token;
+    });
     if (token) *token = t;
-    registrations_.push_back({std::move(name), std::move(queue), std::move(handler), t});
     return 0;
   }
   // Queues every handler registered for name on its queue.
   void post(const std::string& name) {
-    for (auto& r : locked(lock_, registrations_))
+    for (auto& r : registrations_.get())
       if (r.name == name) r.queue->async([handler = r.handler, t = r.token] { handler(t); });
   }
-  void clear() { dropAll(lock_, registrations_); }
-
- private:
-  mutable std::mutex lock_;
-  std::vector<NotificationRegistration> registrations_;
+  void clear() { registrations_.set({}); }
+  struct Registration {
+    std::string name;
+    std::shared_ptr<SerialQueue> queue;
+    std::function<void(int)> handler;
+    int token;
+  };
+  Recorder<Registration> registrations_;
 };
 
-// ---------------------------------------------------------------- device
-
 // Answers only "InternalBuild", when set.
-class FakeDeviceProperties : public DeviceProperties {
- public:
+struct FakeDeviceProperties : DeviceProperties {
   std::optional<bool> boolAnswer(std::string_view key) override {
-    Guard guard(lock_);
-    return key == "InternalBuild" ? internal_ : std::nullopt;
+    return key == "InternalBuild" ? internalBuild.get() : std::nullopt;
   }
   std::optional<std::int32_t> intAnswer(std::string_view) override { return std::nullopt; }
-  void setInternalBuild(bool internal) { Guard guard(lock_); internal_ = internal; }
-
- private:
-  mutable std::mutex lock_;
-  std::optional<bool> internal_;
+  Locked<std::optional<bool>> internalBuild;
 };
 
 // This process is 4242 "vireod"; other names are set by the test.
-class FakeProcessTable : public ProcessTable {
- public:
+struct FakeProcessTable : ProcessTable {
   std::int32_t selfPid() const override { return 4242; }
   std::optional<std::string> selfName() const override { return "vireod"; }
-  std::optional<std::string> shortName(std::int32_t pid) const override {
-    Guard guard(lock_);
-    auto it = names_.find(pid);
-    if (it == names_.end()) return std::nullopt;
-    return it->second;
-  }
-  void setName(std::int32_t pid, std::string name) { Guard guard(lock_); names_[pid] = std::move(name); }
-
- private:
-  mutable std::mutex lock_;
-  std::map<std::int32_t, std::string> names_;
+  std::optional<std::string> shortName(std::int32_t pid) const override { return lookup(names_, pid); }
+  void setName(std::int32_t pid, std::string name) { names_.with([&](auto& n) { n[pid] = std::move(name); }); }
+  Locked<std::map<std::int32_t, std::string>> names_;
 };
 
 // In-memory files under a fixed log directory.
-class FakeDiagnosticFiles : public DiagnosticFiles {
- public:
+struct FakeDiagnosticFiles : DiagnosticFiles {
   std::string logDirectory() const override { return "/fake/logs"; }
   bool createDirectory(const std::string& path, unsigned, Error* error) override {
-    Guard guard(lock_);
-    if (createError_) {
-      if (error) *error = *createError_;
+    if (auto failure = createError_.get()) {
+      if (error) *error = *failure;
       return false;
     }
-    directories_.insert(path);
+    directories.with([&](auto& d) { d.insert(path); });
     return true;
   }
   bool writeAtomically(const std::string& path, std::string_view text, Error*) override {
-    Guard guard(lock_);
-    files_[path] = std::string(text);
+    files.with([&](auto& f) { f[path] = std::string(text); });
     return true;
   }
-  void failCreateDirectory(Error error) { Guard guard(lock_); createError_ = std::move(error); }
-  std::map<std::string, std::string> files() const { return locked(lock_, files_); }
-  std::set<std::string> directories() const { return locked(lock_, directories_); }
-
- private:
-  mutable std::mutex lock_;
-  std::optional<Error> createError_;
-  std::map<std::string, std::string> files_;
-  std::set<std::string> directories_;
+  void failCreateDirectory(Error error) { createError_.set(std::move(error)); }
+  Locked<std::map<std::string, std::string>> files;
+  Locked<std::set<std::string>> directories;
+  Locked<std::optional<Error>> createError_;
 };
-
-// ---------------------------------------------------------------- driver statistics
 
 // One driver ("Speaker", no subgroup) with one channel "X" whose value the test sets;
 // deltas are later minus earlier. Every other driver has no channels.
-class FakeDriverStats : public DriverStatsLibrary {
- public:
+struct FakeDriverStats : DriverStatsLibrary {
   struct Channels : DriverChannelSet {
-    bool speaker = false;
+    explicit Channels(bool s) : speaker(s) {}
+    bool speaker;
   };
   struct Subscribed : DriverSubscribedChannels {
     std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<Subscribed>(); }
@@ -556,13 +416,11 @@ class FakeDriverStats : public DriverStatsLibrary {
     std::int64_t value;
   };
 
-  void setValue(std::int64_t v) { Guard guard(lock_); value_ = v; }
+  void setValue(std::int64_t v) { value_ = v; }
   std::unique_ptr<DriverChannelSet> copyChannelsInGroup(const std::optional<std::string>& group,
                                                         const std::optional<std::string>&, std::uint64_t,
                                                         std::optional<DriverStatsError>*) override {
-    auto set = std::make_unique<Channels>();
-    set->speaker = group == "Speaker";
-    return set;
+    return std::make_unique<Channels>(group == "Speaker");
   }
   std::int32_t channelCount(const DriverChannelSet& set) override {
     return static_cast<const Channels&>(set).speaker ? 1 : 0;
@@ -574,7 +432,7 @@ class FakeDriverStats : public DriverStatsLibrary {
   }
   std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle, const DriverSubscribedChannels&,
                                                  std::optional<DriverStatsError>*) override {
-    return std::make_unique<Samples>(locked(lock_, value_));
+    return std::make_unique<Samples>(value_);
   }
   std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet* earlier, const DriverSampleSet& later,
                                                       std::optional<DriverStatsError>*) override {
@@ -589,25 +447,12 @@ class FakeDriverStats : public DriverStatsLibrary {
   std::int64_t simpleIntegerValue(const DriverChannel& channel) override {
     return static_cast<const Samples&>(channel).value;
   }
-
- private:
-  mutable std::mutex lock_;
-  std::int64_t value_ = 0;
+  std::atomic<std::int64_t> value_{0};
 };
 
-// ---------------------------------------------------------------- process control
-
-// Thrown by FakeProcessControl::exitProcess in place of ending the test.
-struct ProcessExited {
-  int status;
+struct FakeProcessControl : ProcessControl {
+  [[noreturn]] void exitProcess(int status) override { throw status; }  // a test may catch the status
 };
-
-class FakeProcessControl : public ProcessControl {
- public:
-  [[noreturn]] void exitProcess(int status) override { throw ProcessExited{status}; }
-};
-
-// ---------------------------------------------------------------- the bundle
 
 // Owns one fake of each interface. Held closures are dropped first on destruction,
 // while the fakes they may reach are still alive.
@@ -642,7 +487,7 @@ struct FakePlatform {
     dispatcher.clear();
   }
 
-  void setInternalBuild(bool internal) { device.setInternalBuild(internal); }
+  void setInternalBuild(bool internal) { device.internalBuild.set(internal); }
 };
 
 }  // namespace vireo::testing
