@@ -6,10 +6,12 @@
 
 #include <nlohmann/json.hpp>
 
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
+#include <tuple>
 
 #include "ctl/defaults_command.h"
 
@@ -35,13 +37,11 @@ class StoreQueryTest : public ::testing::Test {
       CREATE TABLE energy_events (id INTEGER PRIMARY KEY, client INTEGER NOT NULL, name TEXT NOT NULL,
         payload TEXT NOT NULL, at REAL NOT NULL);
       INSERT INTO telemetry_sessions VALUES (1, '{"client_type":"x"}', '{"client_name":"vireo","service_name":"media"}',
-        '["local"]', 100, NULL);
-      INSERT INTO telemetry_sessions VALUES (2, '{}', '{"client_name":"vireo","service_name":"telephony"}', NULL, 200, 210);
-      INSERT INTO telemetry_messages VALUES (1, 1, NULL, NULL, 3, 4, '{"a_b":1}', 101);
-      INSERT INTO telemetry_messages VALUES (2, 2, NULL, NULL, 9, 0, '{"k":2}', 201);
-      INSERT INTO telemetry_messages VALUES (3, NULL, '{}', '{"service_name":"standalone"}', 8, 4, '{"k":3}', 300);
-      INSERT INTO analytics_events VALUES (1, 'com.orvane.vireo.Session_Generic.Start', '{"x":1}', 150);
-      INSERT INTO analytics_events VALUES (2, 'com.orvane.vireo.vrreportingclientuptime', '{"seconds":2.5}', 250);
+        '["local"]', 100, NULL), (2, '{}', '{"client_name":"vireo","service_name":"telephony"}', NULL, 200, 210);
+      INSERT INTO telemetry_messages VALUES (1, 1, NULL, NULL, 3, 4, '{"a_b":1}', 101), (2, 2, NULL, NULL, 9, 0,
+        '{"k":2}', 201), (3, NULL, '{}', '{"service_name":"standalone"}', 8, 4, '{"k":3}', 300);
+      INSERT INTO analytics_events VALUES (1, 'com.orvane.vireo.Session_Generic.Start', '{"x":1}', 150),
+        (2, 'com.orvane.vireo.vrreportingclientuptime', '{"seconds":2.5}', 250);
       INSERT INTO energy_events VALUES (1, 7, 'Lumen_Haptics', '{"EngineOnDuration":3}', 160);
     )";
     ASSERT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK);
@@ -50,21 +50,19 @@ class StoreQueryTest : public ::testing::Test {
   void TearDown() override { std::filesystem::remove_all(dir_); }
 
   // Runs a query and returns its standard output.
-  std::string run(const std::string& table, std::vector<std::string> args, int* status = nullptr) {
+  std::string run(const std::string& table, std::vector<std::string> args) {
     std::string error;
     auto q = parseStoreQuery(table, args, &error);
     EXPECT_TRUE(q) << error;
     if (!q) return {};
     q->db = db_;
-    std::FILE* out = std::tmpfile();
-    int rc = runStoreQuery(*q, out, stderr);
-    if (status) *status = rc;
-    std::rewind(out);
-    std::string text;
-    char buf[4096];
-    size_t n;
-    while ((n = std::fread(buf, 1, sizeof buf, out)) > 0) text.append(buf, n);
+    char* buf = nullptr;
+    std::size_t size = 0;
+    std::FILE* out = open_memstream(&buf, &size);
+    EXPECT_EQ(runStoreQuery(*q, out, stderr), 0);
     std::fclose(out);
+    std::string text(buf, size);
+    std::free(buf);
     return text;
   }
 
@@ -72,27 +70,20 @@ class StoreQueryTest : public ::testing::Test {
 };
 
 TEST_F(StoreQueryTest, FiltersAndLimitSelectRowsInOrder) {
-  struct Case {
-    std::string table;
-    std::vector<std::string> args;
-    std::vector<int> ids;
+  const std::tuple<std::string, std::vector<std::string>, std::vector<int>> cases[] = {
+      {"sessions", {"--json"}, {1, 2}},
+      {"messages", {"--json", "--name", "tele*"}, {2}},
+      {"messages", {"--json", "--name", "standalone"}, {3}},  // the message's own user_info
+      {"messages", {"--json", "--session", "1"}, {1}},
+      {"messages", {"--json", "--since", "150", "--until=250"}, {2}},
+      {"messages", {"--json", "--limit", "2"}, {2, 3}},  // the last rows, oldest first
+      {"analytics", {"--json", "--name", "*uptime"}, {2}},
+      {"energy", {"--json", "--session", "7"}, {1}},
   };
-  const Case cases[] = {
-      {"sessions", {}, {1, 2}},
-      {"messages", {"--name", "tele*"}, {2}},
-      {"messages", {"--name", "standalone"}, {3}},  // the message's own user_info
-      {"messages", {"--session", "1"}, {1}},
-      {"messages", {"--since", "150", "--until=250"}, {2}},
-      {"messages", {"--limit", "2"}, {2, 3}},  // the last rows, oldest first
-      {"analytics", {"--name", "*uptime"}, {2}},
-      {"energy", {"--session", "7"}, {1}},
-  };
-  for (const auto& c : cases) {
-    std::vector<std::string> args{"--json"};
-    args.insert(args.end(), c.args.begin(), c.args.end());
+  for (const auto& [table, args, expected] : cases) {
     std::vector<int> ids;
-    for (const auto& row : nlohmann::json::parse(run(c.table, args))) ids.push_back(row["id"]);
-    EXPECT_EQ(ids, c.ids) << c.table << " " << c.args.size();
+    for (const auto& row : nlohmann::json::parse(run(table, args))) ids.push_back(row["id"]);
+    EXPECT_EQ(ids, expected) << table << " " << args.back();
   }
   // JSON columns are embedded as JSON, NULL stays null.
   auto rows = nlohmann::json::parse(run("sessions", {"--json"}));
@@ -123,10 +114,10 @@ TEST_F(StoreQueryTest, DefaultsEditTheSuiteFile) {
   std::string suite = dir_ + "/conf/com.orvane.vireo.conf";
   std::FILE* sink = std::tmpfile();
   EXPECT_EQ(runDefaults(suite, {"write", "device_name", "living", "room"}, false, sink, sink), 0);
-  std::ifstream in(suite);
-  std::stringstream ss;
-  ss << in.rdbuf();
-  EXPECT_NE(ss.str().find("device_name=living room\n"), std::string::npos);
+  std::ostringstream text;
+  text << std::ifstream(suite).rdbuf();
+  EXPECT_NE(text.str().find("device_name=living room\n"), std::string::npos);
+  // A missing key reads as 1, a usage error as 2.
   EXPECT_EQ(runDefaults(suite, {"delete", "device_name"}, false, sink, sink), 0);
   EXPECT_EQ(runDefaults(suite, {"read", "device_name"}, false, sink, sink), 1);
   EXPECT_EQ(runDefaults(suite, {"write", "only"}, false, sink, sink), 2);

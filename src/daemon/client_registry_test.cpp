@@ -2,29 +2,28 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-
+#include <sstream>
 #include <string>
 #include <vector>
 
 #include "daemon/bus_choice.h"
 #include "daemon/bus_mailbox.h"
 #include "daemon/notification_center.h"
-#include "dispatch/dispatch.h"
+#include "fakes/fake_platform.h"
 
 namespace vireo::daemon {
 namespace {
 
+using Lines = std::vector<std::string>;
+
 // Records what the registry does, in one log, so that the order can be checked.
 struct Recorder : ListenerDelegate {
-  std::vector<std::string> log;
-  std::vector<std::string> lookups;
+  Lines log, lookups;
   bool accept = true;
 
   bool shouldAcceptNewConnection(ClientConnection& connection) override {
     log.push_back("accept " + connection.description());
-    auto& peer = static_cast<PeerConnection&>(connection);
-    std::string name = peer.name();
+    std::string name = static_cast<PeerConnection&>(connection).name();
     connection.setInvalidationHandler([this, name] { log.push_back("invalidated " + name); });
     connection.resume();
     return accept;
@@ -34,64 +33,53 @@ struct Recorder : ListenerDelegate {
   }
 };
 
-class ClientRegistryTest : public ::testing::Test {
- protected:
-  Recorder rec;
-  ClientRegistry registry{rec, [this](const std::string& name) { rec.lookups.push_back(name); }};
-};
-
-TEST_F(ClientRegistryTest, HoldsCallsUntilCredentialsThenRunsThemInOrder) {
-  registry.call(":1.5", rec.call("a"));
-  registry.call(":1.5", rec.call("b"));
-  registry.call(":1.6", rec.call("other"));
-  EXPECT_EQ(rec.lookups, (std::vector<std::string>{":1.5", ":1.6"}));  // once per name
-  EXPECT_TRUE(rec.log.empty());
-
-  registry.credentialsArrived(":1.5", 42);
-  registry.call(":1.5", rec.call("c"));  // known now: runs at once
-  EXPECT_EQ(rec.log, (std::vector<std::string>{"accept connection :1.5 (pid 42)", "a on :1.5", "b on :1.5",
-                                               "c on :1.5"}));
-  EXPECT_EQ(rec.lookups.size(), 2u);
-}
-
-TEST_F(ClientRegistryTest, InvalidatesOnceWhenTheNameVanishes) {
-  registry.call(":1.5", rec.call("a"));
-  registry.credentialsArrived(":1.5", 42);
-  registry.nameVanished(":1.5");
-  registry.nameVanished(":1.5");
-  registry.nameVanished(":1.99");  // never called: nothing to do
-  EXPECT_EQ(rec.log.back(), "invalidated :1.5");
-  EXPECT_EQ(std::count(rec.log.begin(), rec.log.end(), "invalidated :1.5"), 1);
-  EXPECT_EQ(registry.size(), 0u);
-}
-
-TEST_F(ClientRegistryTest, VanishingBeforeCredentialsRunsHeldCallsThenInvalidates) {
-  registry.call(":1.7", rec.call("a"));
-  registry.nameVanished(":1.7");
-  EXPECT_TRUE(rec.log.empty());
-  registry.credentialsArrived(":1.7", -1);
-  EXPECT_EQ(rec.log, (std::vector<std::string>{"accept connection :1.7 (pid -1)", "a on :1.7", "invalidated :1.7"}));
-  EXPECT_EQ(registry.size(), 0u);
-  registry.credentialsArrived(":1.7", 3);  // a late answer for a forgotten name
-  EXPECT_EQ(rec.log.size(), 3u);
-}
-
-TEST_F(ClientRegistryTest, RefusedClientGetsNoConnectionAndNoInvalidation) {
-  rec.accept = false;
-  registry.call(":1.8", rec.call("a"));
-  registry.credentialsArrived(":1.8", 9);
-  registry.call(":1.8", rec.call("b"));
-  registry.nameVanished(":1.8");
-  EXPECT_EQ(rec.log, (std::vector<std::string>{"accept connection :1.8 (pid 9)", "a refused", "b refused"}));
-}
-
-TEST_F(ClientRegistryTest, LookupThatAnswersAtOnce) {
+// Each script step is "call NAME TAG", "creds NAME PID" or "gone NAME".
+TEST(ClientRegistryTest, HeldCallsRunInOrderAfterCredentialsAndInvalidationComesOnce) {
+  struct Case {
+    bool accept;
+    Lines lookups, script, log;
+  } cases[] = {
+      {true, {":1.5", ":1.6"},  // one lookup per name
+       {"call :1.5 a", "call :1.5 b", "call :1.6 other", "creds :1.5 42", "call :1.5 c"},
+       {"accept connection :1.5 (pid 42)", "a on :1.5", "b on :1.5", "c on :1.5"}},
+      {true, {":1.5"},
+       {"call :1.5 a", "creds :1.5 42", "gone :1.5", "gone :1.5", "gone :1.99"},
+       {"accept connection :1.5 (pid 42)", "a on :1.5", "invalidated :1.5"}},
+      // Vanishing before the credentials: held calls still run, then the invalidation;
+      // a late second answer for the forgotten name does nothing.
+      {true, {":1.7"},
+       {"call :1.7 a", "gone :1.7", "creds :1.7 -1", "creds :1.7 3"},
+       {"accept connection :1.7 (pid -1)", "a on :1.7", "invalidated :1.7"}},
+      // A refused client gets no connection and no invalidation.
+      {false, {":1.8"},
+       {"call :1.8 a", "creds :1.8 9", "call :1.8 b", "gone :1.8"},
+       {"accept connection :1.8 (pid 9)", "a refused", "b refused"}},
+  };
+  for (const auto& c : cases) {
+    Recorder rec;
+    rec.accept = c.accept;
+    ClientRegistry registry{rec, [&](const std::string& name) { rec.lookups.push_back(name); }};
+    for (const auto& step : c.script) {
+      std::istringstream in(step);
+      std::string op, name, arg;
+      in >> op >> name >> arg;
+      if (op == "call") registry.call(name, rec.call(arg));
+      if (op == "creds") registry.credentialsArrived(name, std::stoi(arg));
+      if (op == "gone") registry.nameVanished(name);
+    }
+    EXPECT_EQ(rec.log, c.log) << c.script.front();
+    EXPECT_EQ(rec.lookups, c.lookups) << c.script.front();
+    if (c.log.back().starts_with("invalidated")) {
+      EXPECT_EQ(registry.size(), 0u);
+    }
+  }
   // A lookup that cannot start answers inside call() itself.
+  Recorder rec;
   ClientRegistry* self = nullptr;
   ClientRegistry immediate(rec, [&](const std::string& name) { self->credentialsArrived(name, -1); });
   self = &immediate;
   immediate.call(":1.9", rec.call("a"));
-  EXPECT_EQ(rec.log, (std::vector<std::string>{"accept connection :1.9 (pid -1)", "a on :1.9"}));
+  EXPECT_EQ(rec.log, (Lines{"accept connection :1.9 (pid -1)", "a on :1.9"}));
 }
 
 TEST(BusChoiceTest, OverrideThenStarterThenUser) {
@@ -104,19 +92,12 @@ TEST(BusChoiceTest, OverrideThenStarterThenUser) {
   EXPECT_EQ(chooseBus(nullptr, nullptr, false), BusKind::Session);
 }
 
-// Runs each task at once.
-struct InlineQueue : SerialQueue {
-  explicit InlineQueue(std::string l) : label_(std::move(l)) {}
-  void async(Task task) override { task(); }
-  const std::string& label() const override { return label_; }
-  std::string label_;
-};
-
 // Delivery by name is checked through the bus (bus_service_test); here the refusals.
 TEST(NotificationCenterTest, RefusesEmptyNamesAndMissingQueues) {
   NotificationCenter center;
   int token = 0;
-  EXPECT_NE(center.registerDispatch("", std::make_shared<InlineQueue>("q"), [](int) {}, &token), 0);
+  auto queue = std::make_shared<testing::ManualQueue>("q", QoS::Default);
+  EXPECT_NE(center.registerDispatch("", queue, [](int) {}, &token), 0);
   EXPECT_NE(center.registerDispatch("a", nullptr, [](int) {}, &token), 0);
 }
 
@@ -124,8 +105,7 @@ TEST(BusMailboxTest, RunsInOrderAndInlineOnceClosed) {
   std::vector<int> ran;
   BusMailbox mailbox;
   ASSERT_GE(mailbox.fd(), 0);
-  mailbox.post([&] { ran.push_back(1); });
-  mailbox.post([&] { ran.push_back(2); });
+  for (int i : {1, 2}) mailbox.post([&ran, i] { ran.push_back(i); });
   EXPECT_TRUE(ran.empty());
   mailbox.drain();
   EXPECT_EQ(ran, (std::vector<int>{1, 2}));

@@ -26,29 +26,26 @@ Dictionary dict(std::initializer_list<std::pair<const char*, std::int64_t>> entr
 
 // A scripted library, also for the failures a real one rarely produces.
 struct FakeChannel : DriverChannel {
+  FakeChannel(std::optional<std::string> n, std::int64_t v) : name(std::move(n)), value(v) {}
   std::optional<std::string> name;
-  std::int64_t value = 0;
+  std::int64_t value;
 };
 struct FakeSamples : DriverSampleSet {
   std::vector<FakeChannel> channels;
   std::unique_ptr<DriverSampleSet> copy() const override { return std::make_unique<FakeSamples>(*this); }
 };
 // Sets and subscriptions carry the driver's description ("Speaker-(null)").
-struct FakeSubscribed : DriverSubscribedChannels {
-  std::string driver;
-  std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<FakeSubscribed>(*this); }
-};
-struct FakeChannelSet : DriverChannelSet {
+struct Tagged : DriverChannelSet, DriverSubscribedChannels {
+  explicit Tagged(std::string d) : driver(std::move(d)) {}
+  std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<Tagged>(driver); }
   std::string driver;
 };
 
 struct DriverScript {
   std::int32_t channels = 1;
-  std::optional<std::int64_t> copyError;
-  bool returnsSet = true;
-  bool subscriptionFails = false;
-  std::optional<std::int64_t> samplesError;
-  std::vector<FakeChannel> values;
+  std::optional<std::int64_t> copyError{}, samplesError{};
+  bool returnsSet = true, subscriptionFails = false;
+  std::vector<FakeChannel> values{};
 };
 
 class ScriptedLibrary final : public DriverStatsLibrary {
@@ -62,32 +59,25 @@ class ScriptedLibrary final : public DriverStatsLibrary {
                                                         std::optional<DriverStatsError>* error) override {
     const std::string key = group.value_or("(null)") + "-" + subGroup.value_or("(null)");
     auto it = drivers.find(key);
-    if (it == drivers.end()) return nullptr;
-    if (it->second.copyError) *error = DriverStatsError{*it->second.copyError};
-    if (!it->second.returnsSet) return nullptr;
-    auto set = std::make_unique<FakeChannelSet>();
-    set->driver = key;
-    return set;
+    if (it == drivers.end()) return nullptr;  // a driver the script leaves out is absent
+    const DriverScript& script = it->second;
+    if (script.copyError) *error = DriverStatsError{*script.copyError};
+    return script.returnsSet ? std::make_unique<Tagged>(key) : nullptr;
   }
   std::int32_t channelCount(const DriverChannelSet& set) override {
-    return drivers[static_cast<const FakeChannelSet&>(set).driver].channels;
+    return drivers[dynamic_cast<const Tagged&>(set).driver].channels;
   }
-  DriverSubscriptionHandle createSubscription(const DriverChannelSet& channels,
+  DriverSubscriptionHandle createSubscription(const DriverChannelSet& set,
                                               std::unique_ptr<DriverSubscribedChannels>* subscribed) override {
-    const auto& set = static_cast<const FakeChannelSet&>(channels);
-    if (drivers[set.driver].subscriptionFails) return nullptr;
-    auto s = std::make_unique<FakeSubscribed>();
-    s->driver = set.driver;
-    *subscribed = std::move(s);
+    const auto& driver = dynamic_cast<const Tagged&>(set).driver;
+    if (drivers[driver].subscriptionFails) return nullptr;
+    *subscribed = std::make_unique<Tagged>(driver);
     return this;
   }
   std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle handle, const DriverSubscribedChannels& subscribed,
                                                  std::optional<DriverStatsError>* error) override {
-    const auto* s = dynamic_cast<const FakeSubscribed*>(&subscribed);
-    if (!handle || !s) {
-      *error = DriverStatsError{22};
-      return nullptr;
-    }
+    const auto* s = dynamic_cast<const Tagged*>(&subscribed);
+    if (!handle || !s) return *error = DriverStatsError{22}, nullptr;
     auto samples = std::make_unique<FakeSamples>();
     const DriverScript& script = drivers[s->driver];
     if (script.samplesError) *error = DriverStatsError{*script.samplesError};  // an error wins even with a set
@@ -97,15 +87,11 @@ class ScriptedLibrary final : public DriverStatsLibrary {
   std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet* earlier, const DriverSampleSet& later,
                                                       std::optional<DriverStatsError>* error) override {
     deltaEarlier.push_back(earlier ? "set" : "none");
-    if (deltaError) {
-      *error = DriverStatsError{*deltaError};
-      return nullptr;
-    }
+    if (deltaError) return *error = DriverStatsError{*deltaError}, nullptr;
     auto delta = std::make_unique<FakeSamples>(static_cast<const FakeSamples&>(later));
-    for (std::size_t i = 0; earlier && i < delta->channels.size(); ++i) {
-      const auto& before = static_cast<const FakeSamples&>(*earlier).channels;
-      if (i < before.size()) delta->channels[i].value -= before[i].value;
-    }
+    for (std::size_t i = 0; earlier && i < delta->channels.size(); ++i)
+      if (const auto& before = static_cast<const FakeSamples&>(*earlier).channels; i < before.size())
+        delta->channels[i].value -= before[i].value;
     return delta;
   }
   void iterate(const DriverSampleSet& samples, const std::function<DriverIterate(const DriverChannel&)>& visitor) override {
@@ -116,23 +102,12 @@ class ScriptedLibrary final : public DriverStatsLibrary {
   std::int64_t simpleIntegerValue(const DriverChannel& c) override { return static_cast<const FakeChannel&>(c).value; }
 };
 
-FakeChannel channel(std::optional<std::string> name, std::int64_t value) {
-  FakeChannel c;
-  c.name = std::move(name);
-  c.value = value;
-  return c;
-}
-
 TEST(DriverUtility, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
   ScriptedLibrary library;
-  auto& orvane = library.drivers["OrvaneTK4HB-(null)"].values;
-  auto& speaker = library.drivers["Speaker-(null)"].values;
-  auto& mca = library.drivers["(null)-MCA"].values;  // one channel name in two groups
-  auto& haptics = library.drivers["Haptics-Stats"].values;
-  orvane = {channel("overruns", 0), channel("rx", 10)};
-  speaker = {channel("x", 5)};
-  mca = {channel("drops", 1), channel("drops", 3)};
-  haptics = {channel("on", 0)};
+  auto& orvane = (library.drivers["OrvaneTK4HB-(null)"].values = {{"overruns", 0}, {"rx", 10}});
+  auto& speaker = (library.drivers["Speaker-(null)"].values = {{"x", 5}});
+  auto& mca = (library.drivers["(null)-MCA"].values = {{"drops", 1}, {"drops", 3}});  // one name in two groups
+  auto& haptics = (library.drivers["Haptics-Stats"].values = {{"on", 0}});
   testing::RecordingLogger logger;
   VRReportingDriverUtility utility(library, logger);
   ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
@@ -145,10 +120,10 @@ TEST(DriverUtility, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
   // Nothing grew yet.
   EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
 
-  orvane = {channel("overruns", 2), channel("rx", 15)};
-  speaker = {channel("x", 3)};                       // went down: not reported
-  mca = {channel("drops", 4), channel("drops", 10)};  // +3, then replaced by +7 under the same key
-  haptics = {channel("on", 2)};
+  orvane = {{"overruns", 2}, {"rx", 15}};
+  speaker = {{"x", 3}};                 // went down: not reported
+  mca = {{"drops", 4}, {"drops", 10}};  // +3, then replaced by +7 under the same key
+  haptics = {{"on", 2}};
   auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
   EXPECT_EQ(*delta, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"MCA_drops", 7},
@@ -164,21 +139,16 @@ TEST(DriverUtility, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
 
 TEST(DriverUtility, NoChannelsMeansNoSubscriptionsEmptySnapshotAndNoDelta) {
   ScriptedLibrary library;
-  for (const char* driver : {"OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"})
+  std::vector<std::string> expected{"creating hwreporting driver utility"};
+  for (std::string driver : {"OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"}) {
     library.drivers[driver].channels = 0;
+    expected.push_back("couldn't find any channels for driver group " + driver);
+    expected.push_back("subscribed to group group " + driver);
+  }
   testing::RecordingLogger logger;
   VRReportingDriverUtility utility(library, logger);
   EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
-  EXPECT_THAT(messages(logger),
-              ElementsAre("creating hwreporting driver utility",
-                          "couldn't find any channels for driver group OrvaneTK4HB-(null)",
-                          "subscribed to group group OrvaneTK4HB-(null)",
-                          "couldn't find any channels for driver group Speaker-(null)",
-                          "subscribed to group group Speaker-(null)",
-                          "couldn't find any channels for driver group (null)-MCA",
-                          "subscribed to group group (null)-MCA",
-                          "couldn't find any channels for driver group Haptics-Stats",
-                          "subscribed to group group Haptics-Stats"));
+  EXPECT_EQ(messages(logger), expected);
   for (const auto& line : logger.entries()) {
     EXPECT_EQ(line.scope, LogScope::Driver);
     EXPECT_EQ(line.function, "-[VRReportingDriverUtility init]");
@@ -197,13 +167,12 @@ TEST(DriverUtility, NoChannelsMeansNoSubscriptionsEmptySnapshotAndNoDelta) {
 
 TEST(DriverUtilityFailures, CopyAndSubscriptionErrors) {
   ScriptedLibrary library;
-  library.drivers["OrvaneTK4HB-(null)"].channels = 2;
-  library.drivers["OrvaneTK4HB-(null)"].copyError = 5;  // logged, but the returned set is still subscribed
-  library.drivers["Speaker-(null)"].copyError = 6;
-  library.drivers["Speaker-(null)"].returnsSet = false;
-  library.drivers["(null)-MCA"].channels = 0;
-  library.drivers["Haptics-Stats"].subscriptionFails = true;  // shows up as a sampling error
-  library.drivers["Haptics-Stats"].values = {channel("x", 4)};
+  library.drivers = {
+      {"OrvaneTK4HB-(null)", {.channels = 2, .copyError = 5}},  // logged, but the returned set is still subscribed
+      {"Speaker-(null)", {.copyError = 6, .returnsSet = false}},
+      {"(null)-MCA", {.channels = 0}},
+      {"Haptics-Stats", {.subscriptionFails = true, .values = {{"x", 4}}}},  // shows up as a sampling error
+  };
   testing::RecordingLogger logger;
   VRReportingDriverUtility utility(library, logger);
 
@@ -230,10 +199,9 @@ TEST(DriverUtilityFailures, CopyAndSubscriptionErrors) {
 
 TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriverAndDeltaErrorFallsBackToAbsolutes) {
   ScriptedLibrary library;
-  library.drivers["Speaker-(null)"].values = {channel("x", 4), channel(std::nullopt, 3), channel("z", 0)};
-  library.drivers["(null)-MCA"].values = {channel("m", 1)};
-  library.drivers["Haptics-Stats"].samplesError = 7;
-  library.drivers["Haptics-Stats"].values = {channel("y", 9)};
+  library.drivers = {{"Speaker-(null)", {.values = {{"x", 4}, {std::nullopt, 3}, {"z", 0}}}},
+                     {"(null)-MCA", {.values = {{"m", 1}}}},
+                     {"Haptics-Stats", {.samplesError = 7, .values = {{"y", 9}}}}};
   testing::RecordingLogger logger;
   VRReportingDriverUtility utility(library, logger);
   logger.clear();
@@ -246,7 +214,7 @@ TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriverAndDeltaErrorFallsBa
   EXPECT_EQ(logger.entries()[3].function, "-[VRReportingDriverUtility getSnapShot]");
 
   logger.clear();
-  library.drivers["Speaker-(null)"].values[0] = channel("x", 6);
+  library.drivers["Speaker-(null)"].values[0] = {"x", 6};
   auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
   EXPECT_EQ(*delta, dict({{"Speaker_x", 2}}));

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sqlite3.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -27,14 +26,12 @@ namespace {
 using namespace std::chrono_literals;
 using Backends = std::optional<std::vector<std::string>>;
 using Row = std::vector<std::optional<std::string>>;
+using Names = std::vector<std::string>;
 
 struct TempDir {
-  std::string pattern = (std::filesystem::temp_directory_path() / "vireo-store-XXXXXX").string();
-  std::string dir = ::mkdtemp(pattern.data()) ? pattern : std::string();
-  ~TempDir() {
-    std::error_code ignored;
-    std::filesystem::remove_all(dir, ignored);
-  }
+  std::string dir = (std::filesystem::temp_directory_path() / "vireo-store-XXXXXX").string();
+  TempDir() { EXPECT_NE(::mkdtemp(dir.data()), nullptr); }
+  ~TempDir() { std::error_code ignored; std::filesystem::remove_all(dir, ignored); }
   const std::string& path() const { return dir; }
   std::string sub(const std::string& name) const { return dir + "/" + name; }
   void write(const std::string& name, const std::string& text) const { std::ofstream(sub(name)) << text; }
@@ -45,18 +42,15 @@ class Reader {
  public:
   explicit Reader(const std::string& path) { sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE, nullptr); }
   ~Reader() { sqlite3_close(db_); }
-  Reader(const Reader&) = delete;
-  Reader& operator=(const Reader&) = delete;
   std::vector<Row> query(const std::string& sql) const {
     std::vector<Row> rows;
     sqlite3_stmt* s = nullptr;
     if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &s, nullptr) != SQLITE_OK) return rows;
     while (sqlite3_step(s) == SQLITE_ROW) {
       Row& row = rows.emplace_back();
-      for (int i = 0; i < sqlite3_column_count(s); ++i) {
-        const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(s, i));
-        row.push_back(text ? std::optional<std::string>(text) : std::nullopt);
-      }
+      for (int i = 0; i < sqlite3_column_count(s); ++i)
+        if (auto* text = sqlite3_column_text(s, i)) row.emplace_back(reinterpret_cast<const char*>(text));
+        else row.emplace_back();
     }
     sqlite3_finalize(s);
     return rows;
@@ -76,10 +70,7 @@ struct StoreTest : ::testing::Test {
   TempDir dir;
   SystemClock clock;
   testing::RecordingLogger logger;
-  std::size_t errors() const {
-    auto entries = logger.entries();
-    return std::count_if(entries.begin(), entries.end(), [](const auto& e) { return e.level == LogLevel::Error; });
-  }
+  std::size_t errors() const { return std::ranges::count(logger.entries(), LogLevel::Error, &testing::LogEntry::level); }
   std::string state() const { return dir.sub("state/nested"); }
   std::string db() const { return state() + "/vireo.db"; }
 };
@@ -88,16 +79,12 @@ struct StoreTest : ::testing::Test {
 TEST_F(StoreTest, CreatesTheContractSchemaInWalModeAndRowsShowWithinASecond) {
   LocalStore store(state(), logger, clock);
   ASSERT_TRUE(store.usable());
-  struct stat st {};
-  ASSERT_EQ(::stat(state().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0755u);
-
+  EXPECT_EQ(std::filesystem::status(state()).permissions() & std::filesystem::perms::all, std::filesystem::perms(0755));
   Reader reader(db());
   auto columns = [&](const std::string& table) {
     std::string out;
-    for (const auto& row : reader.query("PRAGMA table_info(" + table + ")")) {
+    for (const auto& row : reader.query("PRAGMA table_info(" + table + ")"))
       out += *row[1] + " " + *row[2] + (*row[3] == "1" ? " NN" : "") + (*row[5] == "1" ? " PK" : "") + ";";
-    }
     return out;
   };
   EXPECT_EQ(columns("telemetry_sessions"),
@@ -107,9 +94,9 @@ TEST_F(StoreTest, CreatesTheContractSchemaInWalModeAndRowsShowWithinASecond) {
             "payload TEXT NN;sent_at REAL NN;");
   EXPECT_EQ(columns("analytics_events"), "id INTEGER PK;name TEXT NN;payload TEXT NN;at REAL NN;");
   EXPECT_EQ(columns("energy_events"), "id INTEGER PK;client INTEGER NN;name TEXT NN;payload TEXT NN;at REAL NN;");
-  auto fk = reader.query("PRAGMA foreign_key_list(telemetry_messages)");
-  ASSERT_EQ(fk.size(), 1u);
-  EXPECT_EQ(*fk[0][2] + "(" + *fk[0][4] + ")<-" + *fk[0][3], "telemetry_sessions(id)<-session");
+  EXPECT_EQ(reader.scalar("SELECT group_concat(\"table\" || '(' || \"to\" || ')<-' || \"from\") "
+                          "FROM pragma_foreign_key_list('telemetry_messages')"),
+            "telemetry_sessions(id)<-session");
   EXPECT_EQ(reader.scalar("SELECT COUNT(*) FROM sqlite_master WHERE type='table'"), "4");
   EXPECT_EQ(reader.scalar("PRAGMA journal_mode"), "wal");
 
@@ -124,11 +111,7 @@ TEST_F(StoreTest, CreatesTheContractSchemaInWalModeAndRowsShowWithinASecond) {
 
 // Another process holding the write lock stands in for a failing disk.
 TEST_F(StoreTest, FailedBatchIsDroppedAfterRetryAndWritingGoesOn) {
-  LocalStore::Options options;
-  options.busyTimeout = 20ms;
-  options.retryDelay = 10ms;
-  options.maxPendingBytes = 64 << 10;
-  LocalStore store(state(), logger, clock, options);
+  LocalStore store(state(), logger, clock, {.maxPendingBytes = 64 << 10, .retryDelay = 10ms, .busyTimeout = 20ms});
   Reader blocker(db());
   ASSERT_TRUE(blocker.exec("BEGIN IMMEDIATE"));
   ASSERT_TRUE(store.insertAnalyticsEvent("lost", Dictionary{}, 1.0));
@@ -157,11 +140,10 @@ TEST_F(StoreTest, FlushedRowsSurviveSigkillAndIdsContinue) {
   if (child == 0) {
     LocalStore store(state(), logger, clock);
     store.insertTelemetrySession(Dictionary{}, Dictionary{}, 1.0);
-    for (int i = 0; i < kFlushed; ++i)
+    for (int i = 0; i < 20 * kFlushed; ++i) {
       store.insertTelemetryMessage(std::nullopt, nullptr, nullptr, 1, 2, Dictionary{{"i", i}}, 1.0);
-    if (!store.flush(10s)) ::_exit(3);
-    for (int i = kFlushed; i < 20 * kFlushed; ++i)
-      store.insertTelemetryMessage(std::nullopt, nullptr, nullptr, 1, 2, Dictionary{{"i", i}}, 1.0);
+      if (i == kFlushed - 1 && !store.flush(10s)) ::_exit(3);
+    }
     ::raise(SIGKILL);
     ::_exit(4);
   }
@@ -186,27 +168,23 @@ struct ServicesTest : StoreTest {
   std::shared_ptr<LocalStore> store = std::make_shared<LocalStore>(state(), logger, clock);
 };
 
-struct Configured {
-  Backends backends;
-  std::thread::id thread;
-};
-
-Configured configure(TelemetrySession& session) {
-  std::promise<Configured> answer;
-  session.startConfiguration([&](Backends backends) {
-    answer.set_value(Configured{std::move(backends), std::this_thread::get_id()});
+// Starts a session's asynchronous call and waits for its answer, noting the answering thread.
+template <typename T, typename Start>
+T await(Start start, std::thread::id* thread = nullptr) {
+  std::promise<T> answer;
+  start([&](T value) {
+    if (thread) *thread = std::this_thread::get_id();
+    answer.set_value(std::move(value));
   });
-  auto future = answer.get_future();
-  EXPECT_EQ(future.wait_for(5s), std::future_status::ready);
-  return future.get();
-}
-
-std::optional<Error> flush(TelemetrySession& session) {
-  std::promise<std::optional<Error>> answer;
-  session.flushMessages([&](std::optional<Error> error) { answer.set_value(std::move(error)); });
   auto future = answer.get_future();
   EXPECT_EQ(future.wait_for(15s), std::future_status::ready);
   return future.get();
+}
+Backends configure(TelemetrySession& session, std::thread::id* thread = nullptr) {
+  return await<Backends>([&](auto done) { session.startConfiguration(done); }, thread);
+}
+std::optional<Error> flush(TelemetrySession& session) {
+  return await<std::optional<Error>>([&](auto done) { session.flushMessages(done); });
 }
 
 TEST_F(ServicesTest, SessionRowAndMessagesAreVisibleOnceTheFlushAnswers) {
@@ -244,36 +222,35 @@ TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {
     std::optional<std::string> column;
   };
   const Case cases[] = {
-      {nullptr, std::vector<std::string>{"local"}, R"(["local"])"},
-      {"# nothing here\nOther=1\n", std::vector<std::string>{"local"}, R"(["local"])"},
+      {nullptr, Names{"local"}, R"(["local"])"},
+      {"# nothing here\nOther=1\n", Names{"local"}, R"(["local"])"},
       {"Backends=none\n", std::nullopt, std::nullopt},
-      {"Backends=\n", std::vector<std::string>{}, "[]"},
-      {"Backends = local , remote\n", std::vector<std::string>{"local", "remote"}, R"(["local","remote"])"},
+      {"Backends=\n", Names{}, "[]"},
+      {"Backends = local , remote\n", Names{"local", "remote"}, R"(["local","remote"])"},
   };
   std::optional<std::thread::id> serviceThread;
+  std::thread::id thread;
   Reader reader(db());
   for (const auto& c : cases) {
     std::filesystem::remove(dir.sub("telemetry.conf"));
     if (c.file) dir.write("telemetry.conf", c.file);
     auto session = service->createSession(Dictionary{}, Dictionary{}, {});
-    auto configured = configure(*session);
-    EXPECT_EQ(configured.backends, c.answer) << (c.file ? c.file : "no file");
+    EXPECT_EQ(configure(*session, &thread), c.answer) << (c.file ? c.file : "no file");
     // One long-lived thread of the service's own answers every call.
-    EXPECT_NE(configured.thread, std::this_thread::get_id());
-    EXPECT_EQ(configured.thread, serviceThread.value_or(configured.thread));
-    serviceThread = configured.thread;
+    EXPECT_NE(thread, std::this_thread::get_id());
+    EXPECT_EQ(thread, serviceThread.value_or(thread));
+    serviceThread = thread;
     ASSERT_TRUE(store->flush(5s));
     auto id = std::to_string(*dynamic_cast<LocalTelemetrySession&>(*session).rowId());
-    auto rows = reader.query("SELECT backends FROM telemetry_sessions WHERE id = " + id);
-    ASSERT_EQ(rows.size(), 1u);
-    EXPECT_EQ(rows[0][0], c.column) << (c.file ? c.file : "no file");
+    EXPECT_EQ(reader.query("SELECT backends FROM telemetry_sessions WHERE id = " + id), std::vector<Row>{{c.column}})
+        << (c.file ? c.file : "no file");
   }
 
   // A session keeps working after its service is gone.
   std::filesystem::remove(dir.sub("telemetry.conf"));
   auto orphan = service->createSession(Dictionary{}, Dictionary{}, {});
   service.reset();
-  EXPECT_EQ(configure(*orphan).backends, Backends(std::vector<std::string>{"local"}));
+  EXPECT_EQ(configure(*orphan), Backends(Names{"local"}));
   EXPECT_EQ(flush(*orphan), std::nullopt);
 }
 
@@ -281,13 +258,10 @@ TEST_F(ServicesTest, AnalyticsExcludedEventsNeverBuildTheirPayload) {
   dir.write("analytics.conf", "Exclude = com.orvane.vireo.Error.*, *.Debug\n");
   LocalAnalyticsService analytics(store, dir.path());
   int calls = 0;
-  auto payload = [&] {
-    ++calls;
-    return Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"k", 1}};
-  };
-  analytics.sendEventLazy("com.orvane.vireo.Error.Error", payload);
-  analytics.sendEventLazy("com.orvane.vireo.Routing_Playback.Debug", payload);
-  analytics.sendEventLazy("com.orvane.vireo.Routing_Playback.Start", payload);
+  auto payload = [&] { return ++calls, Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"k", 1}}; };
+  for (auto* name : {"com.orvane.vireo.Error.Error", "com.orvane.vireo.Routing_Playback.Debug",
+                     "com.orvane.vireo.Routing_Playback.Start"})
+    analytics.sendEventLazy(name, payload);
   EXPECT_EQ(calls, 1);
 
   dir.write("analytics.conf", "Exclude=\n");
@@ -322,13 +296,10 @@ TEST_F(ServicesTest, UnwritableStateDirectoryMakesSendsFailWithoutCrashing) {
   EXPECT_FALSE(service.sendOneMessage(Dictionary{}, Dictionary{}, 1, 2, Dictionary{}, &error));
   EXPECT_TRUE(error);
   EXPECT_TRUE(flush(*session).has_value());
-  EXPECT_EQ(configure(*session).backends, Backends(std::vector<std::string>{"local"}));
+  EXPECT_EQ(configure(*session), Backends(Names{"local"}));
 
   int calls = 0;
-  LocalAnalyticsService(broken, dir.path()).sendEventLazy("e", [&] {
-    ++calls;
-    return Dictionary{};
-  });
+  LocalAnalyticsService(broken, dir.path()).sendEventLazy("e", [&] { return ++calls, Dictionary{}; });
   LocalEnergyLogService(broken).logEvent(28, "Lumen_Haptics", Dictionary{});
   EXPECT_EQ(calls, 1);
   EXPECT_FALSE(broken->flush(1s));
