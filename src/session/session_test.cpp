@@ -21,11 +21,22 @@ class SessionTest : public ::testing::Test {
     p.logger.setVerbose(LogScope::Session, true);
     p.env->backendWaitInterval = 0.01;
   }
-
   std::shared_ptr<VRReportingSession> make(std::uint16_t serviceType = 2, std::int64_t id = 42) {
     auto s = VRReportingSession::initWithID(p.env, id, {100, 101});
     s->setServiceType(serviceType);
     s->setTransactionCompleteBlock([this](bool ok) { completions.push_back(ok); });
+    return s;
+  }
+  // A started session with flat payloads filed directly, as orientation entries are.
+  std::shared_ptr<VRReportingSession> withPayloads(std::uint16_t serviceType, std::vector<Dictionary> payloads,
+                                                   const char* app = nullptr) {
+    auto s = make(serviceType);
+    Dictionary config{{"HostApplicationDisplayID", app ? app : ""}};
+    if (app) s->setConfiguration(&config);
+    s->start();
+    auto array = s->aggregatedPayloadData();
+    std::lock_guard<std::mutex> guard(array->lock);
+    for (auto& d : payloads) array->entries.emplace_back(std::move(d));
     return s;
   }
   static Array entries(const VRReportingSession& s) {
@@ -50,34 +61,32 @@ TEST_F(SessionTest, NewSessionRecordTypeConfigurationAndDestruction) {
   ASSERT_EQ(created.size(), 1u);
   EXPECT_EQ(created[0].level, LogLevel::Info);
   EXPECT_EQ(created[0].function, "-[VRReportingSession initWithID:processIdentifiers:]");
-
   s->setServiceType(1);
   EXPECT_EQ(s->serviceName(), "vesper");
   EXPECT_TRUE(p.logger.contains("setting service type vesper"));
   s->setServiceType(12);  // no label: keeps a usable name
   EXPECT_EQ(s->serviceName(), "unknown");
-  Dictionary first{{"a", 1}};
-  Dictionary second{{"a", 2}, {"b", 3}};
+  Dictionary first{{"a", 1}}, second{{"a", 2}, {"b", 3}};
   s->setConfiguration(&first);
   s->updateDefaults(&second);
   s->setConfiguration(nullptr);
-  EXPECT_EQ(s->userInfo(), (Dictionary{{"a", 2}, {"b", 3}}));
-
+  EXPECT_EQ(s->userInfo(), second);
   s->stop();  // never started: nothing happens
   p.dispatcher.runUntilIdle();
   EXPECT_TRUE(completions.empty());
   EXPECT_EQ(p.tracer.count(trace::kSessionStop), 0u);
   EXPECT_NE(s->aggregatedPayloadData(), nullptr);
-
   s.reset();
   EXPECT_EQ(p.tracer.count(trace::kSessionDestroy), 1u);
-  EXPECT_TRUE(p.logger.contains("deallocing this session 42"));
 }
 
+// Before start and after stop a message goes out on its own, without the session's user info.
 TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
   auto s = make(2);
   Dictionary config{{"HostApplicationDisplayID", "x"}};
   s->setConfiguration(&config);
+  s->sendMessage(Dictionary{{"a b", 1}}, 0x40000008, 4, nullptr);  // created: filed, then single
+  EXPECT_EQ(entries(*s).size(), 1u);
   s->start();
   auto array = s->aggregatedPayloadData();
   s->start();
@@ -95,27 +104,20 @@ TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
   ASSERT_EQ(created.size(), 1u);
   EXPECT_EQ(p.tracer.count(trace::kSessionStart), 1u);
   ASSERT_NE(s->skylarkReportingAgentToken(), nullptr);
-  EXPECT_EQ(created[0].sessionInfo, (Dictionary{{"client_type", 19},
-                                                {"client_version", 2.0},
-                                                {"session_id", 42},
+  EXPECT_EQ(created[0].sessionInfo, (Dictionary{{"client_type", 19}, {"client_version", 2.0}, {"session_id", 42},
                                                 {"batch_event", true},
                                                 {"hierarchy_token", s->skylarkReportingAgentToken()->text}}));
   EXPECT_EQ(created[0].userInfo, (Dictionary{{"client_name", "com.orvane.vireo"},
-                                             {"service_name", "telephony_session"},
-                                             {"HostApplicationDisplayID", "x"}}));
-  EXPECT_EQ(p.logger.count("List of backends"), 1u);
+                                             {"service_name", "telephony_session"}, {"HostApplicationDisplayID", "x"}}));
   auto telemetry = p.telemetry.lastSession();
   auto sent = telemetry->sent();
   ASSERT_EQ(sent.size(), 2u);
-  EXPECT_EQ(sent[0].category, 3);  // low 16 bits
-  EXPECT_EQ(sent[0].type, 1);
-  EXPECT_EQ(sent[0].payload, (Dictionary{{"n", 1}}));
+  EXPECT_EQ(sent[0], (testing::SentMessage{3, 1, Dictionary{{"n", 1}}}));  // low 16 bits of the category
   EXPECT_EQ(sent[1].type, 2);
 
   s->stop();
   EXPECT_EQ(s->aggregatedPayloadData(), nullptr);
   EXPECT_EQ(completions, std::vector<bool>{true});
-  EXPECT_TRUE(p.logger.contains("sending summary event for reporter 42"));
   EXPECT_EQ(telemetry->flushes(), 0);  // flush waits on the queue behind the summary
   p.dispatcher.runAll();
   sent = telemetry->sent();
@@ -125,7 +127,19 @@ TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
   EXPECT_EQ(sent[2].payload.find("VR_Session_Summary_Event")->text(), "2");
   EXPECT_EQ(telemetry->flushes(), 1);
   EXPECT_EQ(s->skylarkReportingSession(), nullptr);
-  EXPECT_TRUE(p.telemetry.oneShots().empty());
+
+  s->sendMessage(Dictionary{{"c", 2}}, 3, 1, nullptr);  // stopped: not filed
+  EXPECT_EQ(s->aggregatedPayloadData(), nullptr);
+  p.dispatcher.runAll();
+  EXPECT_EQ(p.logger.count("session not started, will send as a single message"), 2u);
+  ASSERT_EQ(p.dispatcher.pendingLowPriority(), 2u);
+  p.dispatcher.runLowPriority();
+  auto shots = p.telemetry.oneShots();
+  ASSERT_EQ(shots.size(), 2u);
+  EXPECT_EQ(shots[0], (testing::OneShotMessage{{8, 4, Dictionary{{"a_b", 1}}},
+                                               Dictionary{{"client_type", 19}, {"client_version", 2.0}, {"session_id", -1}},
+                                               Dictionary{{"client_name", "com.orvane.vireo"}, {"service_name", "telephony"}}}));
+  EXPECT_EQ(shots[1].payload, (Dictionary{{"c", 2}}));
 }
 
 TEST_F(SessionTest, IdentifiersCountPerKindAndSurviveRestart) {
@@ -155,43 +169,28 @@ TEST_F(SessionTest, PayloadKeyCleaning) {
 }
 
 TEST_F(SessionTest, BackendAnswers) {
-  struct Case {
-    BackendAnswer answer;
-    bool ownThread;
-    double wait;
-    bool kept;
-    const char* line;
-  };
+  struct Case { BackendAnswer answer; bool ownThread; double wait; bool kept; const char* line; };
   for (Case c : {Case{BackendAnswer::EmptyList, false, 0.01, true, "List of backends"},
                  Case{BackendAnswer::List, true, 30.0, true, "List of backends"},
-                 Case{BackendAnswer::Nothing, false, 0.01, false,
-                      "No backends found, this session won't get sent to the server"},
+                 Case{BackendAnswer::Nothing, false, 0.01, false, "No backends found, this session won't get sent to the server"},
                  Case{BackendAnswer::Never, false, 0.01, false, nullptr}}) {
     SCOPED_TRACE(static_cast<int>(c.answer));
     p.logger.clear();
-    testing::TelemetryBehaviour behaviour;
-    behaviour.answer = c.answer;
-    behaviour.answerOnOwnThread = c.ownThread;
-    p.telemetry.setBehaviour(behaviour);
+    p.telemetry.setBehaviour({c.answer, c.ownThread, false});
     p.env->backendWaitInterval = c.wait;
     auto s = make();
     s->start();
     s->sendMessage(Dictionary{{"n", 1}}, 3, 1, nullptr);
     p.dispatcher.runAll();
-    if (c.line) {
-      EXPECT_EQ(p.logger.count(c.line), 1u);
-    }
+    EXPECT_EQ(c.line ? p.logger.count(c.line) : 1u, 1u);
     EXPECT_EQ(s->skylarkReportingSession() != nullptr, c.kept);
     EXPECT_EQ(p.telemetry.lastSession()->sent().size(), c.kept ? 1u : 0u);
     EXPECT_EQ(p.logger.count("failed to find backend"), c.kept ? 0u : 1u);
-    if (!c.ownThread) {  // an answer from another thread may come after the wait began
-      EXPECT_EQ(p.logger.count("waiting for skylarkreportingd to find backends"), c.kept ? 0u : 1u);
-    }
+    // An answer from another thread may come after the wait began.
+    EXPECT_TRUE(c.ownThread || p.logger.count("waiting for skylarkreportingd to find backends") == (c.kept ? 0u : 1u));
     auto dropped = p.logger.matching("No valid SkylarkReportingSession");
     ASSERT_EQ(dropped.size(), c.kept ? 0u : 1u);
-    if (!c.kept) {
-      EXPECT_EQ(dropped[0].level, LogLevel::Error);
-    }
+    EXPECT_TRUE(c.kept || dropped[0].level == LogLevel::Error);
     EXPECT_FALSE(s->skylarkReportingSessionStarted());
     s->stop();
     p.dispatcher.runAll();
@@ -224,32 +223,6 @@ TEST_F(SessionTest, TestServiceTypeNeverTouchesTelemetry) {
   EXPECT_EQ(p.telemetry.lastSession()->flushes(), 0);
 }
 
-TEST_F(SessionTest, MessagesOutsideARunningSessionGoOutAsSingleMessages) {
-  auto s = make(2);
-  Dictionary config{{"HostApplicationDisplayID", "x"}};
-  s->setConfiguration(&config);
-  s->sendMessage(Dictionary{{"a b", 1}}, 0x40000008, 4, nullptr);  // created: filed, then single
-  EXPECT_EQ(entries(*s).size(), 1u);
-  s->start();
-  s->stop();
-  p.dispatcher.runAll();
-  s->sendMessage(Dictionary{{"c", 2}}, 3, 1, nullptr);  // stopped: not filed
-  EXPECT_EQ(s->aggregatedPayloadData(), nullptr);
-  p.dispatcher.runAll();
-  EXPECT_EQ(p.logger.count("session not started, will send as a single message"), 2u);
-  ASSERT_EQ(p.dispatcher.pendingLowPriority(), 2u);
-  p.dispatcher.runLowPriority();
-  auto shots = p.telemetry.oneShots();
-  ASSERT_EQ(shots.size(), 2u);
-  EXPECT_EQ(shots[0].sessionInfo, (Dictionary{{"client_type", 19}, {"client_version", 2.0}, {"session_id", -1}}));
-  // The session's user info is not sent.
-  EXPECT_EQ(shots[0].userInfo, (Dictionary{{"client_name", "com.orvane.vireo"}, {"service_name", "telephony"}}));
-  EXPECT_EQ(shots[0].category, 8);
-  EXPECT_EQ(shots[0].type, 4);
-  EXPECT_EQ(shots[0].payload, (Dictionary{{"a_b", 1}}));
-  EXPECT_EQ(shots[1].payload, (Dictionary{{"c", 2}}));
-}
-
 TEST_F(SessionTest, SingleMessageDelayNamesAndRefusal) {
   p.random.script({37});
   VRReportingSession::sendSingleMessage(p.env, Dictionary{{"a b", 1}}, 0x40000008, 4, 4, nullptr, nullptr);
@@ -273,8 +246,7 @@ TEST_F(SessionTest, SingleMessageDelayNamesAndRefusal) {
 
   p.telemetry.setBehaviour({BackendAnswer::List, false, true});
   std::optional<std::optional<Error>> got;
-  VRReportingSession::sendSingleMessage(p.env, Dictionary{}, 1, 0, 0, nullptr,
-                                        [&](std::optional<Error> e) { got = e; });
+  VRReportingSession::sendSingleMessage(p.env, Dictionary{}, 1, 0, 0, nullptr, [&](std::optional<Error> e) { got = e; });
   p.dispatcher.runLowPriority();
   ASSERT_TRUE(got.has_value());
   EXPECT_TRUE(got->has_value());
@@ -283,17 +255,7 @@ TEST_F(SessionTest, SingleMessageDelayNamesAndRefusal) {
   EXPECT_EQ(lines[0].level, LogLevel::Error);
 }
 
-TEST_F(SessionTest, QueuedWorkKeepsTheSessionAlive) {
-  auto s = make();
-  s->start();
-  s->sendMessage(Dictionary{{"n", 1}}, 3, 1, nullptr);
-  s.reset();
-  EXPECT_FALSE(p.logger.contains("deallocing"));
-  p.dispatcher.runAll();
-  EXPECT_TRUE(p.logger.contains("deallocing this session 42"));
-  EXPECT_EQ(p.telemetry.lastSession()->sent().size(), 1u);
-}
-
+// Queued work also keeps the session alive after its last owner lets go.
 TEST_F(SessionTest, ConcurrentSendsCountEveryMessage) {
   auto s = make();
   s->start();
@@ -305,39 +267,20 @@ TEST_F(SessionTest, ConcurrentSendsCountEveryMessage) {
   b.join();
   EXPECT_EQ(s->messageTypeCounts().find("Playback_Start")->toInt64(), 400);
   EXPECT_EQ(entries(*s).size(), 400u);
+  s.reset();
+  EXPECT_FALSE(p.logger.contains("deallocing"));
   p.dispatcher.runAll();
+  EXPECT_TRUE(p.logger.contains("deallocing this session 42"));
   EXPECT_EQ(p.telemetry.lastSession()->sent().size(), 400u);
 }
 
-// ---------------------------------------------------------------- summary
-
-class SummaryTest : public SessionTest {
- protected:
-  // A started session with flat payloads filed directly, as orientation entries are.
-  std::shared_ptr<VRReportingSession> withPayloads(std::uint16_t serviceType, std::vector<Dictionary> payloads,
-                                                   const char* app = nullptr) {
-    auto s = make(serviceType);
-    if (app) {
-      Dictionary config{{"HostApplicationDisplayID", app}};
-      s->setConfiguration(&config);
-    }
-    s->start();
-    auto array = s->aggregatedPayloadData();
-    std::lock_guard<std::mutex> guard(array->lock);
-    for (auto& d : payloads) array->entries.emplace_back(std::move(d));
-    return s;
-  }
-};
-
-TEST_F(SummaryTest, JoinsValuesPerKeyAndInsertsUserInfo) {
+TEST_F(SessionTest, SummaryJoinsValuesPerKeyAndInsertsUserInfo) {
   auto s = withPayloads(7, {Dictionary{{"a", 1}, {"b", "x"}}, Dictionary{{"a", 2}}, Dictionary{{"a", 2}}}, "player");
-  auto summary = s->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  EXPECT_EQ(*summary, (Dictionary{{"VR_Session_Summary_Event", "7"}, {"a", "1,2,2"}, {"b", "x"}}));
+  EXPECT_EQ(s->createSummaryEventForSession(),
+            (Dictionary{{"VR_Session_Summary_Event", "7"}, {"a", "1,2,2"}, {"b", "x"}}));
   Array filed = entries(*s);
   ASSERT_EQ(filed.size(), 4u);
   EXPECT_EQ(filed[0], Value(Dictionary{{"HostApplicationDisplayID", "player"}}));
-  EXPECT_TRUE(p.files.files().empty());  // not an internal build
 
   auto empty = withPayloads(7, {});
   EXPECT_FALSE(empty->createSummaryEventForSession().has_value());
@@ -348,7 +291,7 @@ TEST_F(SummaryTest, JoinsValuesPerKeyAndInsertsUserInfo) {
   EXPECT_TRUE(p.telemetry.lastSession()->sent().empty());
 }
 
-TEST_F(SummaryTest, InternalBuildFileNames) {
+TEST_F(SessionTest, SummaryFilesOnInternalBuilds) {
   p.setInternalBuild(true);
   withPayloads(2, {Dictionary{{"a", 1}}}, "player")->createSummaryEventForSession();
   withPayloads(0xFFFF, {Dictionary{{"a", 1}}})->createSummaryEventForSession();
@@ -364,13 +307,11 @@ TEST_F(SummaryTest, InternalBuildFileNames) {
   }
   EXPECT_EQ(suffixes, (std::set<std::string>{"-vireo-player-telephony.json", "-vireo-unknown-unknown.json",
                                              "-vireo-.._.._etc_x-unknown.json"}));
-}
 
-TEST_F(SummaryTest, UnserialisablePayloadIsReportedTwiceAndWritesNoFile) {
-  p.setInternalBuild(true);
+  // Failures are reported again at the write; an unserialisable summary writes no file.
   auto s = withPayloads(2, {Dictionary{{"x", std::numeric_limits<double>::quiet_NaN()}}});
   ASSERT_TRUE(s->createSummaryEventForSession().has_value());
-  EXPECT_TRUE(p.files.files().empty());
+  EXPECT_EQ(p.files.files().size(), 3u);
   auto first = p.logger.matching("dataWithJSONObject: ");
   auto second = p.logger.matching("jsonOutput writeToURL: ");
   ASSERT_EQ(first.size(), 1u);
@@ -379,10 +320,7 @@ TEST_F(SummaryTest, UnserialisablePayloadIsReportedTwiceAndWritesNoFile) {
             second[0].message.substr(second[0].message.find(": ")));
   EXPECT_EQ(first[0].level, LogLevel::Error);
   EXPECT_EQ(second[0].function, "-[VRReportingSession createSummaryEventForSession]");
-}
 
-TEST_F(SummaryTest, DirectoryFailureIsReportedAgainAfterTheWrite) {
-  p.setInternalBuild(true);
   p.files.failCreateDirectory(Error{kGeneralErrorDomain, 13, "denied"});
   withPayloads(2, {Dictionary{{"a", 1}}})->createSummaryEventForSession();
   EXPECT_TRUE(p.logger.contains("can't create logging directory at /fake/logs/Audio/Reporting: denied"));

@@ -207,8 +207,15 @@ class ManualDispatcher : public Dispatcher {
   Locked<std::deque<Task>> lowPriority_;
 };
 
-struct SentMessage { std::uint16_t category = 0, type = 0; Dictionary payload; };
-struct OneShotMessage : SentMessage { Dictionary sessionInfo, userInfo; };
+struct SentMessage {
+  std::uint16_t category = 0, type = 0;
+  Dictionary payload;
+  bool operator==(const SentMessage&) const = default;
+};
+struct OneShotMessage : SentMessage {
+  Dictionary sessionInfo, userInfo;
+  bool operator==(const OneShotMessage&) const = default;
+};
 
 // How a telemetry session answers startConfiguration: with a list of backends, an
 // empty list, no list at all, or never (the completion is kept).
