@@ -36,29 +36,35 @@ struct Recorder : ListenerDelegate {
 // Each script step is "call NAME TAG", "creds NAME PID" or "gone NAME".
 TEST(ClientRegistryTest, HeldCallsRunInOrderAfterCredentialsAndInvalidationComesOnce) {
   struct Case {
-    bool accept;
+    bool accept, immediate;  // immediate: a lookup that cannot start answers inside call()
     Lines lookups, script, log;
   } cases[] = {
-      {true, {":1.5", ":1.6"},  // one lookup per name
+      {true, false, {":1.5", ":1.6"},  // one lookup per name
        {"call :1.5 a", "call :1.5 b", "call :1.6 other", "creds :1.5 42", "call :1.5 c"},
        {"accept connection :1.5 (pid 42)", "a on :1.5", "b on :1.5", "c on :1.5"}},
-      {true, {":1.5"},
+      {true, false, {":1.5"},
        {"call :1.5 a", "creds :1.5 42", "gone :1.5", "gone :1.5", "gone :1.99"},
        {"accept connection :1.5 (pid 42)", "a on :1.5", "invalidated :1.5"}},
       // Vanishing before the credentials: held calls still run, then the invalidation;
       // a late second answer for the forgotten name does nothing.
-      {true, {":1.7"},
+      {true, false, {":1.7"},
        {"call :1.7 a", "gone :1.7", "creds :1.7 -1", "creds :1.7 3"},
        {"accept connection :1.7 (pid -1)", "a on :1.7", "invalidated :1.7"}},
       // A refused client gets no connection and no invalidation.
-      {false, {":1.8"},
+      {false, false, {":1.8"},
        {"call :1.8 a", "creds :1.8 9", "call :1.8 b", "gone :1.8"},
        {"accept connection :1.8 (pid 9)", "a refused", "b refused"}},
+      {true, true, {":1.9"}, {"call :1.9 a"}, {"accept connection :1.9 (pid -1)", "a on :1.9"}},
   };
   for (const auto& c : cases) {
     Recorder rec;
     rec.accept = c.accept;
-    ClientRegistry registry{rec, [&](const std::string& name) { rec.lookups.push_back(name); }};
+    ClientRegistry* self = nullptr;
+    ClientRegistry registry{rec, [&](const std::string& name) {
+                              rec.lookups.push_back(name);
+                              if (c.immediate) self->credentialsArrived(name, -1);
+                            }};
+    self = &registry;
     for (const auto& step : c.script) {
       std::istringstream in(step);
       std::string op, name, arg;
@@ -73,13 +79,6 @@ TEST(ClientRegistryTest, HeldCallsRunInOrderAfterCredentialsAndInvalidationComes
       EXPECT_EQ(registry.size(), 0u);
     }
   }
-  // A lookup that cannot start answers inside call() itself.
-  Recorder rec;
-  ClientRegistry* self = nullptr;
-  ClientRegistry immediate(rec, [&](const std::string& name) { self->credentialsArrived(name, -1); });
-  self = &immediate;
-  immediate.call(":1.9", rec.call("a"));
-  EXPECT_EQ(rec.log, (Lines{"accept connection :1.9 (pid -1)", "a on :1.9"}));
 }
 
 TEST(BusChoiceTest, OverrideThenStarterThenUser) {

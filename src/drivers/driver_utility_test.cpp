@@ -18,12 +18,6 @@ std::vector<std::string> messages(const testing::RecordingLogger& logger) {
   return out;
 }
 
-Dictionary dict(std::initializer_list<std::pair<const char*, std::int64_t>> entries) {
-  Dictionary d;
-  for (const auto& [k, v] : entries) d.set(Value(k), Value(v));
-  return d;
-}
-
 // A scripted library, also for the failures a real one rarely produces.
 struct FakeChannel : DriverChannel {
   FakeChannel(std::optional<std::string> n, std::int64_t v) : name(std::move(n)), value(v) {}
@@ -126,14 +120,14 @@ TEST(DriverUtility, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
   haptics = {{"on", 2}};
   auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
-  EXPECT_EQ(*delta, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"MCA_drops", 7},
+  EXPECT_EQ(*delta, (Dictionary{{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 5}, {"MCA_drops", 7},
                           {"Haptics_Stats_on", 2}}));
   EXPECT_EQ(delta->find("MCA_drops")->kind(), Value::Kind::Int);
 
   // Without a snapshot: absolute values of at least 1.
   auto absolute = utility.getDriverStatisticsRelativeToSnapShot(nullptr);
   ASSERT_TRUE(absolute);
-  EXPECT_EQ(*absolute, dict({{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 15}, {"Speaker_x", 3},
+  EXPECT_EQ(*absolute, (Dictionary{{"OrvaneTK4HB_overruns", 2}, {"OrvaneTK4HB_rx", 15}, {"Speaker_x", 3},
                              {"MCA_drops", 10}, {"Haptics_Stats_on", 2}}));
 }
 
@@ -217,7 +211,7 @@ TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriverAndDeltaErrorFallsBa
   library.drivers["Speaker-(null)"].values[0] = {"x", 6};
   auto delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
-  EXPECT_EQ(*delta, dict({{"Speaker_x", 2}}));
+  EXPECT_EQ(*delta, (Dictionary{{"Speaker_x", 2}}));
   EXPECT_THAT(messages(logger), ElementsAre("getting latest samples", "done getting latest samples",
                                              "getting latest samples", "done getting latest samples",
                                              "getting latest samples", "done getting latest samples",
@@ -232,7 +226,7 @@ TEST(DriverUtilityFailures, SamplingErrorDropsOnlyThatDriverAndDeltaErrorFallsBa
   delta = utility.getDriverStatisticsRelativeToSnapShot(snapshot.get());
   ASSERT_TRUE(delta);
   // A nameless channel leaves the key ending in "_".
-  EXPECT_EQ(*delta, dict({{"Speaker_x", 6}, {"Speaker_", 3}, {"MCA_m", 1}}));
+  EXPECT_EQ(*delta, (Dictionary{{"Speaker_x", 6}, {"Speaker_", 3}, {"MCA_m", 1}}));
   EXPECT_THAT(library.deltaEarlier, ElementsAre("set", "none"));
   EXPECT_EQ(messages(logger)[2], "HWReportCreateSamplesDelta error 9");
   EXPECT_EQ(logger.entries()[2].level, LogLevel::Error);

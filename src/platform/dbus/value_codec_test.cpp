@@ -22,8 +22,7 @@ class ValueCodecTest : public ::testing::Test {
     ASSERT_GE(sd_bus_start(bus_.get()), 0);
   }
   void TearDown() override {
-    sd_bus_close(bus_.get());  // nothing to flush: the peer never answers
-    bus_.reset();              // closes fds_[0]
+    sd_bus_close(bus_.get());  // nothing to flush: the peer never answers; closes fds_[0]
     close(fds_[1]);
   }
 
