@@ -480,8 +480,7 @@ struct FakePlatform {
   FakeProcessControl process;
   ManualDispatcher dispatcher;
 
-  Platform platform{logger,    tracer,        clock,  random,    dispatcher, telemetry,   analytics, energyLog,
-                    defaults,  notifications, device, processes, files,      driverStats, process};
+  Platform platform = over(dispatcher);
   std::shared_ptr<ReportingEnvironment> env = std::make_shared<ReportingEnvironment>(platform);
 
   FakePlatform() = default;
@@ -495,6 +494,11 @@ struct FakePlatform {
   }
 
   void setInternalBuild(bool internal) { device.internalBuild.set(internal); }
+  // These fakes over another dispatcher (the thread tests use the real pool).
+  Platform over(Dispatcher& d) {
+    return {logger,        tracer, clock,     random, d,           telemetry, analytics, energyLog, defaults,
+            notifications, device, processes, files,  driverStats, process};
+  }
 };
 
 }  // namespace vireo::testing
