@@ -25,40 +25,22 @@ namespace {
 
 using namespace std::chrono_literals;
 using Backends = std::optional<std::vector<std::string>>;
-using Row = std::vector<std::optional<std::string>>;
 using Names = std::vector<std::string>;
-
-struct TempDir {
-  std::string dir = (std::filesystem::temp_directory_path() / "vireo-store-XXXXXX").string();
-  TempDir() { EXPECT_NE(::mkdtemp(dir.data()), nullptr); }
-  ~TempDir() { std::error_code ignored; std::filesystem::remove_all(dir, ignored); }
-  const std::string& path() const { return dir; }
-  std::string sub(const std::string& name) const { return dir + "/" + name; }
-  void write(const std::string& name, const std::string& text) const { std::ofstream(sub(name)) << text; }
-};
 
 // An independent reader of the store's file, as another process would see it.
 class Reader {
  public:
   explicit Reader(const std::string& path) { sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE, nullptr); }
   ~Reader() { sqlite3_close(db_); }
-  std::vector<Row> query(const std::string& sql) const {
-    std::vector<Row> rows;
-    sqlite3_stmt* s = nullptr;
-    if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &s, nullptr) != SQLITE_OK) return rows;
-    while (sqlite3_step(s) == SQLITE_ROW) {
-      Row& row = rows.emplace_back();
-      for (int i = 0; i < sqlite3_column_count(s); ++i)
-        if (auto* text = sqlite3_column_text(s, i)) row.emplace_back(reinterpret_cast<const char*>(text));
-        else row.emplace_back();
-    }
-    sqlite3_finalize(s);
-    return rows;
-  }
   // The first column of the first row, "" when there is none or it is NULL.
   std::string scalar(const std::string& sql) const {
-    auto rows = query(sql);
-    return rows.empty() || rows[0].empty() || !rows[0][0] ? std::string() : *rows[0][0];
+    sqlite3_stmt* s = nullptr;
+    std::string out;
+    if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &s, nullptr) == SQLITE_OK && sqlite3_step(s) == SQLITE_ROW &&
+        sqlite3_column_text(s, 0))
+      out = reinterpret_cast<const char*>(sqlite3_column_text(s, 0));
+    sqlite3_finalize(s);
+    return out;
   }
   bool exec(const std::string& sql) const { return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr) == SQLITE_OK; }
 
@@ -66,26 +48,29 @@ class Reader {
   sqlite3* db_ = nullptr;
 };
 
+// Each test in its own temporary directory, removed afterwards.
 struct StoreTest : ::testing::Test {
-  TempDir dir;
+  StoreTest() { EXPECT_NE(::mkdtemp(root.data()), nullptr); }
+  ~StoreTest() override { std::error_code ignored; std::filesystem::remove_all(root, ignored); }
+  std::string sub(const std::string& name) const { return root + "/" + name; }
+  void write(const std::string& name, const std::string& text) const { std::ofstream(sub(name)) << text; }
+  std::string root = (std::filesystem::temp_directory_path() / "vireo-store-XXXXXX").string();
   SystemClock clock;
   testing::RecordingLogger logger;
   std::size_t errors() const { return std::ranges::count(logger.entries(), LogLevel::Error, &testing::LogEntry::level); }
-  std::string state() const { return dir.sub("state/nested"); }
+  std::string state() const { return sub("state/nested"); }
   std::string db() const { return state() + "/vireo.db"; }
 };
 
-// cid|name|type|notnull|dflt|pk of each column, as the contract's tables have them.
+// Name, type, NOT NULL and PRIMARY KEY of each column, as the contract's tables have them.
 TEST_F(StoreTest, CreatesTheContractSchemaInWalModeAndRowsShowWithinASecond) {
   LocalStore store(state(), logger, clock);
   ASSERT_TRUE(store.usable());
   EXPECT_EQ(std::filesystem::status(state()).permissions() & std::filesystem::perms::all, std::filesystem::perms(0755));
   Reader reader(db());
   auto columns = [&](const std::string& table) {
-    std::string out;
-    for (const auto& row : reader.query("PRAGMA table_info(" + table + ")"))
-      out += *row[1] + " " + *row[2] + (*row[3] == "1" ? " NN" : "") + (*row[5] == "1" ? " PK" : "") + ";";
-    return out;
+    return reader.scalar("SELECT group_concat(name || ' ' || type || iif(\"notnull\", ' NN', '') || iif(pk, ' PK', '')"
+                         " || ';', '') FROM pragma_table_info('" + table + "')");
   };
   EXPECT_EQ(columns("telemetry_sessions"),
             "id INTEGER PK;session_info TEXT NN;user_info TEXT NN;backends TEXT;created_at REAL NN;flushed_at REAL;");
@@ -188,7 +173,7 @@ std::optional<Error> flush(TelemetrySession& session) {
 }
 
 TEST_F(ServicesTest, SessionRowAndMessagesAreVisibleOnceTheFlushAnswers) {
-  LocalTelemetryService service(store, dir.path());
+  LocalTelemetryService service(store, root);
   Dictionary info{{"client_type", 19}, {"client_version", 2.0}, {"session_id", 7}, {"batch_event", true},
                   {"hierarchy_token", service.makeHierarchyToken()->text}};
   Dictionary user{{"client_name", "com.orvane.vireo"}, {"service_name", "telephony_session"}, {"Host", "x"}};
@@ -215,7 +200,7 @@ TEST_F(ServicesTest, SessionRowAndMessagesAreVisibleOnceTheFlushAnswers) {
 }
 
 TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {
-  auto service = std::make_unique<LocalTelemetryService>(store, dir.path());
+  auto service = std::make_unique<LocalTelemetryService>(store, root);
   struct Case {
     const char* file;  // nullptr: no telemetry.conf
     Backends answer;
@@ -232,8 +217,8 @@ TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {
   std::thread::id thread;
   Reader reader(db());
   for (const auto& c : cases) {
-    std::filesystem::remove(dir.sub("telemetry.conf"));
-    if (c.file) dir.write("telemetry.conf", c.file);
+    std::filesystem::remove(sub("telemetry.conf"));
+    if (c.file) write("telemetry.conf", c.file);
     auto session = service->createSession(Dictionary{}, Dictionary{}, {});
     EXPECT_EQ(configure(*session, &thread), c.answer) << (c.file ? c.file : "no file");
     // One long-lived thread of the service's own answers every call.
@@ -242,12 +227,14 @@ TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {
     serviceThread = thread;
     ASSERT_TRUE(store->flush(5s));
     auto id = std::to_string(*dynamic_cast<LocalTelemetrySession&>(*session).rowId());
-    EXPECT_EQ(reader.query("SELECT backends FROM telemetry_sessions WHERE id = " + id), std::vector<Row>{{c.column}})
+    EXPECT_EQ(reader.scalar("SELECT COUNT(*) || ' ' || ifnull(MAX(backends), 'NULL') FROM telemetry_sessions "
+                            "WHERE id = " + id),
+              "1 " + c.column.value_or("NULL"))
         << (c.file ? c.file : "no file");
   }
 
   // A session keeps working after its service is gone.
-  std::filesystem::remove(dir.sub("telemetry.conf"));
+  std::filesystem::remove(sub("telemetry.conf"));
   auto orphan = service->createSession(Dictionary{}, Dictionary{}, {});
   service.reset();
   EXPECT_EQ(configure(*orphan), Backends(Names{"local"}));
@@ -255,8 +242,8 @@ TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {
 }
 
 TEST_F(ServicesTest, AnalyticsExcludedEventsNeverBuildTheirPayload) {
-  dir.write("analytics.conf", "Exclude = com.orvane.vireo.Error.*, *.Debug\n");
-  LocalAnalyticsService analytics(store, dir.path());
+  write("analytics.conf", "Exclude = com.orvane.vireo.Error.*, *.Debug\n");
+  LocalAnalyticsService analytics(store, root);
   int calls = 0;
   auto payload = [&] { return ++calls, Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"k", 1}}; };
   for (auto* name : {"com.orvane.vireo.Error.Error", "com.orvane.vireo.Routing_Playback.Debug",
@@ -264,7 +251,7 @@ TEST_F(ServicesTest, AnalyticsExcludedEventsNeverBuildTheirPayload) {
     analytics.sendEventLazy(name, payload);
   EXPECT_EQ(calls, 1);
 
-  dir.write("analytics.conf", "Exclude=\n");
+  write("analytics.conf", "Exclude=\n");
   analytics.reload();
   analytics.sendEventLazy("com.orvane.vireo.Error.Error", payload);
   EXPECT_EQ(calls, 2);
@@ -282,12 +269,12 @@ TEST_F(ServicesTest, AnalyticsExcludedEventsNeverBuildTheirPayload) {
 }
 
 TEST_F(ServicesTest, UnwritableStateDirectoryMakesSendsFailWithoutCrashing) {
-  dir.write("plain-file", "not a directory");
-  auto broken = std::make_shared<LocalStore>(dir.sub("plain-file/state"), logger, clock);
+  write("plain-file", "not a directory");
+  auto broken = std::make_shared<LocalStore>(sub("plain-file/state"), logger, clock);
   EXPECT_FALSE(broken->usable());
   EXPECT_GE(errors(), 1u);
 
-  LocalTelemetryService service(broken, dir.path());
+  LocalTelemetryService service(broken, root);
   auto session = service.createSession(Dictionary{}, Dictionary{}, {});
   std::optional<Error> error;
   EXPECT_FALSE(session->sendMessage(1, 2, Dictionary{}, &error));
@@ -299,7 +286,7 @@ TEST_F(ServicesTest, UnwritableStateDirectoryMakesSendsFailWithoutCrashing) {
   EXPECT_EQ(configure(*session), Backends(Names{"local"}));
 
   int calls = 0;
-  LocalAnalyticsService(broken, dir.path()).sendEventLazy("e", [&] { return ++calls, Dictionary{}; });
+  LocalAnalyticsService(broken, root).sendEventLazy("e", [&] { return ++calls, Dictionary{}; });
   LocalEnergyLogService(broken).logEvent(28, "Lumen_Haptics", Dictionary{});
   EXPECT_EQ(calls, 1);
   EXPECT_FALSE(broken->flush(1s));
