@@ -107,8 +107,8 @@ TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
   EXPECT_EQ(created[0].sessionInfo, (Dictionary{{"client_type", 19}, {"client_version", 2.0}, {"session_id", 42},
                                                 {"batch_event", true},
                                                 {"hierarchy_token", s->skylarkReportingAgentToken()->text}}));
-  EXPECT_EQ(created[0].userInfo, (Dictionary{{"client_name", "com.orvane.vireo"},
-                                             {"service_name", "telephony_session"}, {"HostApplicationDisplayID", "x"}}));
+  EXPECT_EQ(created[0].userInfo, (Dictionary{{"client_name", "com.orvane.vireo"}, {"service_name", "telephony_session"},
+                                             {"HostApplicationDisplayID", "x"}}));
   auto telemetry = p.telemetry.lastSession();
   auto sent = telemetry->sent();
   ASSERT_EQ(sent.size(), 2u);
@@ -172,7 +172,8 @@ TEST_F(SessionTest, BackendAnswers) {
   struct Case { BackendAnswer answer; bool ownThread; double wait; bool kept; const char* line; };
   for (Case c : {Case{BackendAnswer::EmptyList, false, 0.01, true, "List of backends"},
                  Case{BackendAnswer::List, true, 30.0, true, "List of backends"},
-                 Case{BackendAnswer::Nothing, false, 0.01, false, "No backends found, this session won't get sent to the server"},
+                 Case{BackendAnswer::Nothing, false, 0.01, false,
+                      "No backends found, this session won't get sent to the server"},
                  Case{BackendAnswer::Never, false, 0.01, false, nullptr}}) {
     SCOPED_TRACE(static_cast<int>(c.answer));
     p.logger.clear();
@@ -246,7 +247,8 @@ TEST_F(SessionTest, SingleMessageDelayNamesAndRefusal) {
 
   p.telemetry.setBehaviour({BackendAnswer::List, false, true});
   std::optional<std::optional<Error>> got;
-  VRReportingSession::sendSingleMessage(p.env, Dictionary{}, 1, 0, 0, nullptr, [&](std::optional<Error> e) { got = e; });
+  VRReportingSession::sendSingleMessage(p.env, Dictionary{}, 1, 0, 0, nullptr,
+                                        [&](std::optional<Error> e) { got = e; });
   p.dispatcher.runLowPriority();
   ASSERT_TRUE(got.has_value());
   EXPECT_TRUE(got->has_value());

@@ -222,7 +222,10 @@ struct OneShotMessage : SentMessage {
 enum class BackendAnswer { List, EmptyList, Nothing, Never };
 
 // Answering on its own thread is what the real service does; refusal applies to one-shot sends.
-struct TelemetryBehaviour { BackendAnswer answer = BackendAnswer::List; bool answerOnOwnThread = false, refuseSends = false; };
+struct TelemetryBehaviour {
+  BackendAnswer answer = BackendAnswer::List;
+  bool answerOnOwnThread = false, refuseSends = false;
+};
 
 class FakeTelemetrySession : public TelemetrySession {
  public:
@@ -339,7 +342,9 @@ struct FakeDefaultsStore : DefaultsStore {
   void set(std::string suite, std::string key, std::string value) {
     values_.with([&](auto& v) { v[{std::move(suite), std::move(key)}] = std::move(value); });
   }
-  void remove(const std::string& suite, const std::string& key) { values_.with([&](auto& v) { v.erase({suite, key}); }); }
+  void remove(const std::string& suite, const std::string& key) {
+    values_.with([&](auto& v) { v.erase({suite, key}); });
+  }
   Locked<std::map<std::pair<std::string, std::string>, std::string>> values_;
 };
 
