@@ -323,7 +323,7 @@ TEST_F(SessionTest, SummaryFilesOnInternalBuilds) {
   EXPECT_EQ(first[0].level, LogLevel::Error);
   EXPECT_EQ(second[0].function, "-[VRReportingSession createSummaryEventForSession]");
 
-  p.files.failCreateDirectory(Error{kGeneralErrorDomain, 13, "denied"});
+  p.files.createDirectoryError.set(Error{kGeneralErrorDomain, 13, "denied"});
   withPayloads(2, {Dictionary{{"a", 1}}})->createSummaryEventForSession();
   EXPECT_TRUE(p.logger.contains("can't create logging directory at /fake/logs/Audio/Reporting: denied"));
   EXPECT_TRUE(p.logger.contains("jsonOutput writeToURL: denied"));

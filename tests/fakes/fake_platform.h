@@ -29,8 +29,6 @@ namespace vireo::testing {
 template <typename T>
 class Locked {
  public:
-  Locked() = default;
-  explicit Locked(T value) : value_(std::move(value)) {}
   template <typename F>
   auto with(F&& f) const {
     std::lock_guard guard(lock_);
@@ -56,7 +54,7 @@ template <typename T>
 std::optional<T> popFront(Locked<std::deque<T>>& items) {
   return items.with([](std::deque<T>& d) -> std::optional<T> {
     if (d.empty()) return std::nullopt;
-    T item = std::move(d.front());
+    std::optional<T> item(std::move(d.front()));
     d.pop_front();
     return item;
   });
@@ -81,12 +79,10 @@ struct RecordingLogger : Logger {
   void setVerbose(LogScope scope, bool on) {
     verbose_.with([&](auto& s) { on ? (void)s.insert(scope) : (void)s.erase(scope); });
   }
-  // Entries whose message contains text.
   std::vector<LogEntry> matching(std::string_view text) const {
-    std::vector<LogEntry> out;
-    for (auto& e : entries())
-      if (e.message.find(text) != std::string::npos) out.push_back(e);
-    return out;
+    auto all = entries();
+    std::erase_if(all, [&](auto& e) { return e.message.find(text) == std::string::npos; });
+    return all;
   }
   bool contains(std::string_view text) const { return count(text) > 0; }
   std::size_t count(std::string_view text) const { return matching(text).size(); }
@@ -106,11 +102,11 @@ struct RecordingTracer : Tracer {
 };
 
 struct FakeClock : Clock {
-  WallTime now() const override { return now_.get(); }
+  WallTime now() const override { return WallTime(std::chrono::seconds(1'700'000'000)) + moved(); }
   void advance(std::chrono::nanoseconds d) {
-    now_.with([&](WallTime& t) { t += std::chrono::duration_cast<WallTime::duration>(d); });
+    moved.with([&](WallTime::duration& m) { m += std::chrono::duration_cast<WallTime::duration>(d); });
   }
-  Locked<WallTime> now_{WallTime(std::chrono::seconds(1'700'000'000))};
+  Locked<WallTime::duration> moved;
 };
 
 // Returns the scripted values in order (each reduced below the bound), then 0.
@@ -133,7 +129,6 @@ class ManualQueue : public SerialQueue {
   void async(Task task) override { tasks_.with([&](auto& t) { t.push_back(std::move(task)); }); }
   const std::string& label() const override { return label_; }
   QoS qos() const { return qos_; }
-  // Runs the oldest held closure; false when there was none.
   bool runOne() {
     auto task = popFront(tasks_);
     if (task && *task) (*task)();
@@ -175,20 +170,15 @@ class ManualDispatcher : public Dispatcher {
       for (auto& q : queues()) ran = q->runOne() || ran;
     }
   }
-  // Runs the held low-priority closures; returns how many ran.
   std::size_t runLowPriority() {
     std::size_t n = 0;
     for (std::optional<Task> t; (t = popFront(lowPriority_)); ++n)
       if (*t) (*t)();
     return n;
   }
-  void runUntilIdle() {
-    while (runAll(), runLowPriority() != 0) {
-    }
-  }
+  void runUntilIdle() { do runAll(); while (runLowPriority() != 0); }
   std::size_t pendingLowPriority() const { return lowPriority_.with([](auto& l) { return l.size(); }); }
   Recorder<std::chrono::nanoseconds> lowPriorityDelays;
-  // Drops every held closure without running it.
   void clear() {
     lowPriority_.set({});
     for (auto& q : queues()) q->clear();
@@ -208,7 +198,7 @@ class ManualDispatcher : public Dispatcher {
 };
 
 struct SentMessage {
-  std::uint16_t category = 0, type = 0;
+  std::uint16_t category, type;
   Dictionary payload;
   bool operator==(const SentMessage&) const = default;
 };
@@ -292,9 +282,7 @@ class FakeTelemetryService : public TelemetryService {
     auto all = created();
     return all.empty() ? nullptr : all.back().session;
   }
-  void dropHeld() {
-    for (auto& c : created()) c.session->dropHeld();
-  }
+  void dropHeld() { for (auto& c : created()) c.session->dropHeld(); }
   Recorder<CreatedSession> created;
   Recorder<OneShotMessage> oneShots;
 
@@ -358,17 +346,13 @@ struct FakeNotificationService : NotificationService {
     if (token) *token = t;
     return 0;
   }
-  // Queues every handler registered for name on its queue.
   void post(const std::string& name) {
     for (auto& r : registrations_.get())
       if (r.name == name) r.queue->async([handler = r.handler, t = r.token] { handler(t); });
   }
   void clear() { registrations_.set({}); }
   struct Registration {
-    std::string name;
-    std::shared_ptr<SerialQueue> queue;
-    std::function<void(int)> handler;
-    int token;
+    std::string name; std::shared_ptr<SerialQueue> queue; std::function<void(int)> handler; int token;
   };
   Recorder<Registration> registrations_;
 };
@@ -376,7 +360,7 @@ struct FakeNotificationService : NotificationService {
 // Answers only "InternalBuild", when set.
 struct FakeDeviceProperties : DeviceProperties {
   std::optional<bool> boolAnswer(std::string_view key) override {
-    return key == "InternalBuild" ? internalBuild.get() : std::nullopt;
+    return key == "InternalBuild" ? internalBuild() : std::nullopt;
   }
   std::optional<std::int32_t> intAnswer(std::string_view) override { return std::nullopt; }
   Locked<std::optional<bool>> internalBuild;
@@ -395,7 +379,7 @@ struct FakeProcessTable : ProcessTable {
 struct FakeDiagnosticFiles : DiagnosticFiles {
   std::string logDirectory() const override { return "/fake/logs"; }
   bool createDirectory(const std::string& path, unsigned, Error* error) override {
-    if (auto failure = createError_.get()) {
+    if (auto failure = createDirectoryError()) {
       if (error) *error = *failure;
       return false;
     }
@@ -406,10 +390,9 @@ struct FakeDiagnosticFiles : DiagnosticFiles {
     files.with([&](auto& f) { f[path] = std::string(text); });
     return true;
   }
-  void failCreateDirectory(Error error) { createError_.set(std::move(error)); }
   Locked<std::map<std::string, std::string>> files;
   Locked<std::set<std::string>> directories;
-  Locked<std::optional<Error>> createError_;
+  Locked<std::optional<Error>> createDirectoryError;
 };
 
 // One driver ("Speaker", no subgroup) with one channel "X" whose value the test sets;
@@ -488,9 +471,6 @@ struct FakePlatform {
   Platform platform = over(dispatcher);
   std::shared_ptr<ReportingEnvironment> env = std::make_shared<ReportingEnvironment>(platform);
 
-  FakePlatform() = default;
-  FakePlatform(const FakePlatform&) = delete;
-  FakePlatform& operator=(const FakePlatform&) = delete;
   ~FakePlatform() {
     analytics.onCall = energyLog.onCall = nullptr;
     telemetry.dropHeld();
