@@ -79,23 +79,6 @@ TEST_F(ServiceTest, OperationsEmitTheirTraceCodesOncePerCall) {
   EXPECT_EQ(tracer.count(trace::kSessionStop), 1u);
 }
 
-TEST_F(ServiceTest, CreateUnderAnExistingIDReplacesWithoutStoppingAndKeepsItsPlace) {
-  auto c = h.connect(100, "player");
-  create(*c, 5);
-  create(*c, 6);
-  start(*c, 5);
-  auto first = sessionOf(*c, 5);
-  create(*c, 5);
-  auto second = sessionOf(*c, 5);
-  EXPECT_NE(first, second);
-  EXPECT_TRUE(first->started());
-  EXPECT_FALSE(second->started());
-  Replies<std::vector<std::int64_t>> reporters;
-  c->client().getAllReporters(reporters.callback());
-  h.pump();
-  EXPECT_EQ(reporters.values, (std::vector<std::vector<std::int64_t>>{{5, 6}}));
-}
-
 TEST_F(ServiceTest, StopSendsTheDriverDeltaBeforeTheSummary) {
   auto c = h.connect(100, "player");
   create(*c, 5, 2);
@@ -124,13 +107,20 @@ TEST_F(ServiceTest, StopSendsTheDriverDeltaBeforeTheSummary) {
   EXPECT_EQ(starts.values, (std::vector<bool>{true, true}));
 }
 
+// A create under an existing ID replaces the session without stopping it and keeps its place.
 TEST_F(ServiceTest, LookupFollowsRegistryOrderAndOnlyTheOwnerStopsOrDestroys) {
   auto first = h.connect(100, "player");
   auto second = h.connect(200, "phone");
   auto asker = h.connect(300, "alarm");
   create(*second, 9, 2);
-  create(*first, 9, 1);
+  create(*first, 9);
   create(*first, 3);
+  start(*first, 9);
+  auto replaced = sessionOf(*first, 9);
+  create(*first, 9, 1);
+  EXPECT_TRUE(replaced->started());
+  EXPECT_NE(sessionOf(*first, 9), replaced);
+  EXPECT_FALSE(sessionOf(*first, 9)->started());
   Replies<Dictionary> valid;
   asker->client().reporterIDValid(9, valid.callback());
   Replies<std::vector<std::int64_t>> reporters;
