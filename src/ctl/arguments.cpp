@@ -247,14 +247,14 @@ std::optional<Operation> parseOperation(const std::vector<std::string>& w, std::
   }
   Operation op;
   op.name = w[0];
-  const Spec* spec = nullptr;
+  const Spec* entry = nullptr;
   for (const auto& s : kOps)
-    if (w[0] == s.word) spec = &s;
-  if (!spec) {
+    if (w[0] == s.word) entry = &s;
+  if (!entry) {
     fail(error, "unknown operation '" + w[0] + "'");
     return std::nullopt;
   }
-  op.kind = spec->kind;
+  op.kind = entry->kind;
   auto exact = [&](size_t n) {
     if (w.size() == n) return true;
     return fail(error, op.name + ": expected " + std::to_string(n - 1) + " argument(s)");

@@ -106,12 +106,12 @@ std::optional<StoreQuery> parseStoreQuery(const std::string& table, const std::v
                                           std::string* error) {
   StoreQuery q;
   q.table = table;
-  const TableSpec* spec = findTable(table);
+  const TableSpec* entry = findTable(table);
   auto fail = [&](std::string text) {
     if (error) *error = table + ": " + text;
     return std::nullopt;
   };
-  if (!spec) return fail("unknown store table");
+  if (!entry) return fail("unknown store table");
   for (size_t i = 0; i < args.size(); ++i) {
     std::string flag = args[i];
     std::string value;
@@ -130,7 +130,7 @@ std::optional<StoreQuery> parseStoreQuery(const std::string& table, const std::v
       value = args[++i];
     }
     if (flag == "--session") {
-      if (!spec->sessionColumn) return fail("--session does not apply to " + table);
+      if (!entry->sessionColumn) return fail("--session does not apply to " + table);
       auto id = parseInt64(value);
       if (!id) return fail("bad --session '" + value + "'");
       q.session = *id;
@@ -154,16 +154,16 @@ std::optional<StoreQuery> parseStoreQuery(const std::string& table, const std::v
 }
 
 std::string storeSql(const StoreQuery& q) {
-  const TableSpec* spec = findTable(q.table);
-  std::string sql = spec->select;
+  const TableSpec* entry = findTable(q.table);
+  std::string sql = entry->select;
   std::vector<std::string> where;
-  if (q.name) where.push_back(spec->nameExpr);
-  if (q.session) where.push_back(std::string(spec->sessionColumn) + " = ?2");
-  if (q.since) where.push_back(std::string(spec->timeColumn) + " >= ?3");
-  if (q.until) where.push_back(std::string(spec->timeColumn) + " <= ?4");
+  if (q.name) where.push_back(entry->nameExpr);
+  if (q.session) where.push_back(std::string(entry->sessionColumn) + " = ?2");
+  if (q.since) where.push_back(std::string(entry->timeColumn) + " >= ?3");
+  if (q.until) where.push_back(std::string(entry->timeColumn) + " <= ?4");
   for (size_t i = 0; i < where.size(); ++i) sql += (i == 0 ? " WHERE " : " AND ") + where[i];
   // The last N rows, shown oldest first.
-  sql += std::string(" ORDER BY ") + spec->idColumn + (q.limit ? " DESC LIMIT ?5" : " ASC");
+  sql += std::string(" ORDER BY ") + entry->idColumn + (q.limit ? " DESC LIMIT ?5" : " ASC");
   if (q.limit) sql = "SELECT * FROM (" + sql + ") ORDER BY id ASC";
   return sql;
 }
