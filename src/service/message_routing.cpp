@@ -25,6 +25,16 @@ std::string idsText(const std::optional<std::vector<std::int64_t>>& reporterIDs)
   for (std::int64_t id : *reporterIDs) ids.emplace_back(Value(std::int64_t{id}));
   return Value(std::move(ids)).text();
 }
+
+// "[session, session]", as the log lines show a list of sessions.
+std::string sessionsText(const std::vector<std::shared_ptr<VRReportingSession>>& sessions) {
+  std::string out = "[";
+  for (const auto& session : sessions) {
+    if (out.size() > 1) out += ", ";
+    out += session->description();
+  }
+  return out + ']';
+}
 }  // namespace
 
 void VRReportingServerInstance::sendMessage(Dictionary payload, std::uint32_t category, std::uint16_t type,
@@ -72,19 +82,18 @@ void VRReportingServerInstance::sendAddressed(const Dictionary& payload, std::ui
 void VRReportingServerInstance::sendBroadcast(const Dictionary& payload, std::uint32_t category, std::uint16_t type,
                                               VRReportingServiceDelegateProtocol* delegate) {
   std::vector<std::shared_ptr<VRReportingSession>> active;
-  std::string activeText;
   for (const auto& client : delegate->getAllClients()) {
+    // One snapshot of the client's map serves both the log line and the filter.
+    std::vector<std::shared_ptr<VRReportingSession>> sessions;
+    for (auto& entry : client->clientReportingSessionMap()) sessions.push_back(std::move(entry.second));
     VR_LOG(env_->logger(), LogScope::Server, LogLevel::Default, kSendLabel, "sessions for client %i : %s",
-           client->processIdentifier(), client->sessionsDescription().c_str());
-    for (const auto& entry : client->clientReportingSessionMap()) {
-      if (!entry.second->started()) continue;
-      activeText += activeText.empty() ? "" : ", ";
-      activeText += entry.second->description();
-      active.push_back(entry.second);
+           client->processIdentifier(), sessionsText(sessions).c_str());
+    for (auto& session : sessions) {
+      if (session->started()) active.push_back(std::move(session));
     }
   }
   VR_LOG(env_->logger(), LogScope::Server, LogLevel::Default, kSendLabel, "active reporting sessions %lu : %s",
-         (unsigned long)active.size(), ("[" + activeText + "]").c_str());
+         (unsigned long)active.size(), sessionsText(active).c_str());
 
   if (active.empty()) {
     VR_LOG(env_->logger(), LogScope::Server, LogLevel::Default, kSendLabel,

@@ -65,18 +65,6 @@ std::vector<ReportingSessionMap::Entry> VRReportingServerInstance::clientReporti
   return clientReportingSessionMap_.entries();
 }
 
-std::string VRReportingServerInstance::sessionsDescription() const {
-  std::string out = "[";
-  bool first = true;
-  for (const auto& entry : clientReportingSessionMap()) {
-    if (!first) out += ", ";
-    first = false;
-    out += entry.second->description();
-  }
-  out += ']';
-  return out;
-}
-
 std::shared_ptr<VRReportingSession> VRReportingServerInstance::findReportingSessionForID(std::int64_t reporterID,
                                                                                         bool acrossAllClients) const {
   {

@@ -63,9 +63,6 @@ class VRReportingServerInstance final : public VRReportingServiceProtocol,
   // clientReportingSessionMap, as a snapshot in map order.
   std::vector<ReportingSessionMap::Entry> clientReportingSessionMap() const;
 
-  // "[session, session]" of the map's sessions, for log lines.
-  std::string sessionsDescription() const;
-
  private:
   VRReportingServerInstance(std::shared_ptr<ReportingEnvironment> env, std::shared_ptr<SerialQueue> serverQueue,
                             std::int32_t pid, std::weak_ptr<VRReportingServiceDelegateProtocol> delegate);
