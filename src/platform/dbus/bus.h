@@ -15,14 +15,6 @@ template <typename T, T* (*RefFn)(T*), T* (*UnrefFn)(T*)>
 class Ref {
  public:
   Ref() noexcept = default;
-  // Adopts a reference the caller already owns.
-  static Ref adopt(T* p) noexcept {
-    Ref r;
-    r.p_ = p;
-    return r;
-  }
-  // Takes a new reference.
-  static Ref share(T* p) noexcept { return adopt(p ? RefFn(p) : nullptr); }
   Ref(const Ref& o) noexcept : p_(o.p_ ? RefFn(o.p_) : nullptr) {}
   Ref(Ref&& o) noexcept : p_(std::exchange(o.p_, nullptr)) {}
   Ref& operator=(Ref o) noexcept {
@@ -36,7 +28,6 @@ class Ref {
     reset();
     return &p_;
   }
-  T* release() noexcept { return std::exchange(p_, nullptr); }
   void reset() noexcept {
     if (p_) UnrefFn(std::exchange(p_, nullptr));
   }
@@ -62,7 +53,6 @@ class BusError {
   ~BusError() { sd_bus_error_free(&e_); }
 
   sd_bus_error* get() noexcept { return &e_; }
-  bool isSet() const noexcept { return sd_bus_error_is_set(&e_); }
   const char* name() const noexcept { return e_.name ? e_.name : ""; }
   const char* message() const noexcept { return e_.message ? e_.message : ""; }
 
@@ -71,8 +61,5 @@ class BusError {
 };
 
 inline constexpr const char* kInvalidArgs = "org.freedesktop.DBus.Error.InvalidArgs";
-
-// "name: message" of an error, or the text of a negative errno.
-std::string describeError(const sd_bus_error* error, int r);
 
 }  // namespace vireo::dbus
