@@ -86,12 +86,11 @@ int bindText(sqlite3_stmt* s, int index, const std::string& text) {
 struct LocalStore::Row {
   enum class Kind : std::uint8_t { Session, Backends, Flushed, Message, Analytics, Energy };
   Kind kind = Kind::Message;
-  bool hasId = false;     // Message: belongs to a session; Backends: not NULL
+  bool hasId = false;     // Message: belongs to a session (else one-shot, with info); Backends: not NULL
   std::int64_t id = 0;    // the session's row id
   std::int64_t a = 0;     // category or client
   std::int64_t b = 0;     // type
   double at = 0;
-  bool hasInfo = false;   // Message: one-shot session and user info present
   std::string t1, t2, t3; // JSON columns and names, per kind
 
   std::size_t bytes() const { return sizeof(Row) + t1.capacity() + t2.capacity() + t3.capacity(); }
@@ -281,7 +280,6 @@ bool LocalStore::insertTelemetryMessage(std::optional<std::int64_t> session, con
   row.hasId = session.has_value();
   row.id = session.value_or(0);
   if (!session) {
-    row.hasInfo = true;
     row.t1 = sessionInfo ? jsonObject(*sessionInfo) : "{}";
     row.t2 = userInfo ? jsonObject(*userInfo) : "{}";
   }
@@ -414,17 +412,15 @@ bool LocalStore::writeRow(const Row& row) {
       break;
     case Row::Kind::Message:
       s = statements_[kInsertMessage];
+      // A session's message; otherwise a one-shot one, which alone carries the info.
       if (row.hasId) {
         sqlite3_bind_int64(s, 1, row.id);
-      } else {
-        sqlite3_bind_null(s, 1);
-      }
-      if (row.hasInfo) {
-        bindText(s, 2, row.t1);
-        bindText(s, 3, row.t2);
-      } else {
         sqlite3_bind_null(s, 2);
         sqlite3_bind_null(s, 3);
+      } else {
+        sqlite3_bind_null(s, 1);
+        bindText(s, 2, row.t1);
+        bindText(s, 3, row.t2);
       }
       sqlite3_bind_int64(s, 4, row.a);
       sqlite3_bind_int64(s, 5, row.b);

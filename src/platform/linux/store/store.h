@@ -55,7 +55,6 @@ class LocalStore {
 
   bool usable() const { return usable_.load(std::memory_order_acquire); }
   const std::string& path() const { return path_; }
-  Clock& clock() const { return clock_; }
   Logger& logger() const { return logger_; }
   double now() const { return unixSeconds(clock_.now()); }
 
