@@ -60,7 +60,6 @@ class VRReportingServiceDelegate final : public VRReportingServiceDelegateProtoc
   Dictionary VRReportingDefaults() const;
   void listenForDefaultsNotification();
 
-  const std::shared_ptr<SerialQueue>& serverQueue() const { return serverQueue_; }
   const VRReportingDriverUtility& driverUtility() const { return *driverUtility_; }
 
  private:
