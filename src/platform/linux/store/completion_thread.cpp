@@ -24,7 +24,11 @@ CompletionThread::CompletionThread() : state_(std::make_shared<State>()) {
       auto work = std::move(state->queue.front());
       state->queue.pop_front();
       lock.unlock();
-      work();
+      // A completion's failure stays inside it: the thread serves every session.
+      try {
+        work();
+      } catch (...) {
+      }
       work = nullptr;  // drop captures outside the lock
       lock.lock();
     }
