@@ -13,6 +13,8 @@
 // any thread is made), so that only the loop receives them.
 #pragma once
 
+#include "vireo/bus_names.h"
+
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -35,13 +37,13 @@ namespace vireo::daemon {
 
 class PendingCall;
 
-inline constexpr const char* kServiceName = "com.orvane.vireo.Reporting1";
-inline constexpr const char* kObjectPath = "/com/orvane/vireo/Reporting1";
-inline constexpr const char* kInterfaceName = "com.orvane.vireo.Reporting1";
-inline constexpr const char* kNotifyPath = "/com/orvane/Notify1";
-inline constexpr const char* kNotifyInterface = "com.orvane.Notify1";
-inline constexpr const char* kDefaultsNotification = "com.orvane.vireo.reporting";
-inline constexpr const char* kReportingDisabledError = "com.orvane.audio.reporting.ReportingDisabled";
+using bus::kNotifyInterface;
+using bus::kNotifyPath;
+using bus::kObjectPath;
+using bus::kReportingDisabledError;
+using bus::kServiceName;
+inline constexpr const char* kInterfaceName = bus::kInterface;
+inline constexpr const char* kDefaultsNotification = bus::kReportingNotification;
 
 // Blocks SIGTERM, SIGINT and SIGHUP in the calling thread (and the threads it makes).
 void blockServiceSignals();

@@ -18,14 +18,16 @@
 
 #include "base/value.h"
 
+#include "vireo/bus_names.h"
+
 namespace vireo::client {
 
-inline constexpr const char* kServiceName = "com.orvane.vireo.Reporting1";
-inline constexpr const char* kObjectPath = "/com/orvane/vireo/Reporting1";
-inline constexpr const char* kInterface = "com.orvane.vireo.Reporting1";
-inline constexpr const char* kReportingDisabledError = "com.orvane.audio.reporting.ReportingDisabled";
+using bus::kInterface;
+using bus::kObjectPath;
+using bus::kReportingDisabledError;
+using bus::kReportingNotification;
+using bus::kServiceName;
 inline constexpr const char* kReportingDomain = "com.orvane.audio.reporting";
-inline constexpr const char* kReportingNotification = "com.orvane.vireo.reporting";
 
 // A failed call. name is the D-Bus error name (or a local one such as
 // "org.freedesktop.DBus.Error.Disconnected"); the reporting-disabled error also

@@ -1,0 +1,15 @@
+// The names on the bus that the daemon and every client share.
+#pragma once
+
+namespace vireo::bus {
+
+inline constexpr const char* kServiceName = "com.orvane.vireo.Reporting1";
+inline constexpr const char* kObjectPath = "/com/orvane/vireo/Reporting1";
+inline constexpr const char* kInterface = "com.orvane.vireo.Reporting1";
+// The defaults change notification: Posted(s name) on this path and interface.
+inline constexpr const char* kNotifyPath = "/com/orvane/Notify1";
+inline constexpr const char* kNotifyInterface = "com.orvane.Notify1";
+inline constexpr const char* kReportingNotification = "com.orvane.vireo.reporting";
+inline constexpr const char* kReportingDisabledError = "com.orvane.audio.reporting.ReportingDisabled";
+
+}  // namespace vireo::bus
