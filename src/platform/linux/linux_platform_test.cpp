@@ -72,8 +72,14 @@ TEST(KeyFile, ParsesAndConvertsValues) {
 }
 
 // A memory file that stands in for stderr.
+// Append mode: a memfd lacks the shared-offset locking of ordinary files, so
+// concurrent writers would otherwise overwrite each other's lines.
 struct MemFile {
-  int fd = ::memfd_create("log", MFD_CLOEXEC);
+  int fd = [] {
+    int f = ::memfd_create("log", MFD_CLOEXEC);
+    ::fcntl(f, F_SETFL, O_APPEND);
+    return f;
+  }();
   ~MemFile() { ::close(fd); }
   std::string text() const { return readAll("/proc/self/fd/" + std::to_string(fd)); }
 };
