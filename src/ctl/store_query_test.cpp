@@ -14,6 +14,7 @@
 #include <tuple>
 
 #include "ctl/defaults_command.h"
+#include "fakes/temp_dir.h"
 
 namespace vireo::ctl {
 namespace {
@@ -21,10 +22,6 @@ namespace {
 class StoreQueryTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char tmpl[] = "/tmp/vireoctl-test-XXXXXX";
-    ASSERT_TRUE(mkdtemp(tmpl));
-    dir_ = tmpl;
-    db_ = dir_ + "/vireo.db";
     sqlite3* db = nullptr;
     ASSERT_EQ(sqlite3_open(db_.c_str(), &db), SQLITE_OK);
     const char* sql = R"(
@@ -47,7 +44,6 @@ class StoreQueryTest : public ::testing::Test {
     ASSERT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK);
     sqlite3_close(db);
   }
-  void TearDown() override { std::filesystem::remove_all(dir_); }
 
   // Runs a query and returns its standard output.
   std::string run(const std::string& table, std::vector<std::string> args) {
@@ -66,7 +62,9 @@ class StoreQueryTest : public ::testing::Test {
     return text;
   }
 
-  std::string dir_, db_;
+  testing::TempDir tmp_;
+  const std::string dir_ = tmp_.path();
+  const std::string db_ = dir_ + "/vireo.db";
 };
 
 TEST_F(StoreQueryTest, FiltersAndLimitSelectRowsInOrder) {

@@ -22,25 +22,14 @@
 #include "platform/linux/key_file.h"
 #include "platform/linux/linux_logger.h"
 #include "platform/linux/process_table.h"
+#include "fakes/temp_dir.h"
 
 namespace vireo::linux_platform {
 namespace {
 
 namespace fs = std::filesystem;
 
-struct TempDir {
-  std::string pattern = (fs::temp_directory_path() / "vireo-linux-XXXXXX").string();
-  std::string dir = ::mkdtemp(pattern.data()) ? pattern : std::string();
-  ~TempDir() {
-    std::error_code ec;
-    fs::remove_all(dir, ec);
-  }
-  const std::string& path() const { return dir; }
-  void write(const std::string& name, const std::string& text) const {
-    fs::create_directories(fs::path(dir + "/" + name).parent_path());
-    std::ofstream(dir + "/" + name, std::ios::binary) << text;
-  }
-};
+using testing::TempDir;
 
 std::string readAll(const std::string& path) {
   std::ostringstream ss;

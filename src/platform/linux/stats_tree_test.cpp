@@ -1,4 +1,5 @@
 #include "platform/linux/stats_tree.h"
+#include "fakes/temp_dir.h"
 
 #include <unistd.h>
 
@@ -18,15 +19,7 @@ namespace fs = std::filesystem;
 using ::testing::ElementsAre;
 using ::testing::Pair;
 
-struct TempDir {
-  std::string pattern = (fs::temp_directory_path() / "vireo-stats-XXXXXX").string();
-  fs::path dir = ::mkdtemp(pattern.data()) ? pattern : std::string();
-  ~TempDir() {
-    std::error_code ec;
-    fs::remove_all(dir, ec);
-  }
-  const fs::path& path() const { return dir; }
-};
+using testing::TempDir;
 
 void writeFile(const fs::path& path, const std::string& text) {
   fs::create_directories(path.parent_path());
@@ -75,7 +68,7 @@ TEST(StatsCounterParse, AcceptsOneIntegerWithBlanksAround) {
 
 TEST(StatsTreeLibrary, SelectsByGroupSubgroupOrBoth) {
   TempDir dir;
-  const fs::path stats = dir.path() / "stats";
+  const fs::path stats = fs::path(dir.path()) / "stats";
   writeFile(stats / "OrvaneTK4HB/rx", "1");
   writeFile(stats / "OrvaneTK4HB/dsp/tx", "2");
   writeFile(stats / "Speaker/x", "3");
@@ -107,7 +100,7 @@ TEST(StatsTreeLibrary, SelectsByGroupSubgroupOrBoth) {
   EXPECT_THAT(valuesOf(library, *sample(library, mca)), ElementsAre(Pair("drops", 4), Pair("drops", 5)));
 
   // An absent tree: an empty set and no error.
-  StatsTreeLibrary absent((dir.path() / "none").string());
+  StatsTreeLibrary absent((fs::path(dir.path()) / "none").string());
   std::optional<DriverStatsError> error;
   auto set = absent.copyChannelsInGroup("Speaker", std::nullopt, 0, &error);
   ASSERT_TRUE(set);
@@ -125,8 +118,8 @@ struct ForeignChannels final : DriverSubscribedChannels {
 
 TEST(StatsTreeLibrary, ReadsFilesAgainButKeepsTheChannelSetOfTheStart) {
   TempDir dir;
-  const fs::path stats = dir.path() / "stats";
-  const fs::path counters = dir.path() / "counters";
+  const fs::path stats = fs::path(dir.path()) / "stats";
+  const fs::path counters = fs::path(dir.path()) / "counters";
   writeFile(stats / "Speaker/a", "10\n");
   writeFile(stats / "Speaker/bad", "n/a\n");
   writeFile(stats / "Speaker/gone", "5\n");

@@ -18,6 +18,7 @@
 #include "platform/linux/store/energy_log_service.h"
 #include "platform/linux/store/telemetry_service.h"
 #include "fakes/fake_platform.h"
+#include "fakes/temp_dir.h"
 #include "platform/linux/system_clock.h"
 
 namespace vireo::linux_platform {
@@ -50,11 +51,10 @@ class Reader {
 
 // Each test in its own temporary directory, removed afterwards.
 struct StoreTest : ::testing::Test {
-  StoreTest() { EXPECT_NE(::mkdtemp(root.data()), nullptr); }
-  ~StoreTest() override { std::error_code ignored; std::filesystem::remove_all(root, ignored); }
-  std::string sub(const std::string& name) const { return root + "/" + name; }
-  void write(const std::string& name, const std::string& text) const { std::ofstream(sub(name)) << text; }
-  std::string root = (std::filesystem::temp_directory_path() / "vireo-store-XXXXXX").string();
+  std::string sub(const std::string& name) const { return dir.sub(name); }
+  void write(const std::string& name, const std::string& text) const { dir.write(name, text); }
+  testing::TempDir dir;
+  const std::string& root = dir.path();
   SystemClock clock;
   testing::RecordingLogger logger;
   std::size_t errors() const { return std::ranges::count(logger.entries(), LogLevel::Error, &testing::LogEntry::level); }
