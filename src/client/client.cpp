@@ -438,6 +438,19 @@ Status Client::ping() {
   return Done{};
 }
 
+Status Client::setInterfaceOrientation(const std::string& orientation) {
+  std::lock_guard lock(conn_->mu);
+  sd_bus_error e = SD_BUS_ERROR_NULL;
+  int r = sd_bus_call_method(conn_->bus, kServiceName, kObjectPath, bus::kOrientationInterface,
+                             "SetInterfaceOrientation", &e, nullptr, "s", orientation.c_str());
+  if (r < 0) {
+    Error err = errorFromBusError(&e, r, "SetInterfaceOrientation");
+    sd_bus_error_free(&e);
+    return err;
+  }
+  return Done{};
+}
+
 std::size_t Client::pump(std::chrono::milliseconds timeout) {
   conn_->pumpOnce(timeout);
   return conn_->pending.load();

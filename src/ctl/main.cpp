@@ -23,6 +23,8 @@ constexpr const char* kHelp = R"(usage: vireoctl [OPTIONS] OPERATION [ARGS...] [
        vireoctl [OPTIONS] -            (or: script) operations from standard input, one per line
        vireoctl defaults read [KEY] | write KEY VALUE | delete KEY
        vireoctl notify [NAME]          (default com.orvane.vireo.reporting)
+       vireoctl orientation TEXT       report the interface orientation (normal, bottom-up,
+                                       left-up, right-up, undefined), as the shell does
        vireoctl sessions|messages|analytics|energy [FILTERS] [--json]
 
 A reporting session lives only as long as the connection of the client that made it,
@@ -185,6 +187,17 @@ int main(int argc, char** argv) {
       return 1;
     }
     if (o.json) std::printf("{\"op\":\"notify\",\"name\":\"%s\"}\n", name.c_str());
+    return 0;
+  }
+  if (command == "orientation") {
+    if (rest.size() != 1) return usageError("orientation takes one orientation text");
+    auto c = connect(o);
+    client::Status s = c ? (*c)->setInterfaceOrientation(rest[0]) : client::Status(c.error());
+    if (!s) {
+      std::fprintf(stderr, "vireoctl: orientation: %s: %s\n", s.error().name.c_str(), s.error().message.c_str());
+      return 1;
+    }
+    if (o.json) std::printf("{\"op\":\"orientation\",\"orientation\":\"%s\"}\n", rest[0].c_str());
     return 0;
   }
   if (ctl::isStoreCommand(command)) {

@@ -223,6 +223,21 @@ struct BusServiceAccess {
     });
   }
 
+  static int setInterfaceOrientation(sd_bus_message* m, void* userdata, sd_bus_error* error) {
+    return guarded(error, [&] {
+      const char* text = nullptr;
+      int r = sd_bus_message_read(m, "s", &text);
+      if (r < 0) return r;
+      auto orientation = OrientationService::orientationFromText(text);
+      if (!orientation)
+        return sd_bus_error_setf(error, dbus::kInvalidArgs,
+                                 "unknown orientation \"%s\" (normal, bottom-up, left-up, right-up or undefined)",
+                                 text);
+      if (auto& sink = self(userdata).interfaceOrientation_) sink(*orientation);
+      return sd_bus_reply_method_return(m, "");
+    });
+  }
+
   static int killService(sd_bus_message* m, void* userdata, sd_bus_error* error) {
     return guarded(error, [&] {
       self(userdata).submit(m, [](auto& object, auto& p) { object.killService(answerBool(p)); });
@@ -262,6 +277,12 @@ const sd_bus_vtable kReportingVtable[] = {
     // Never answered: the process ends.
     SD_BUS_METHOD("KillService", "", "", BusServiceAccess::killService,
                   kMethodFlags | SD_BUS_VTABLE_METHOD_NO_REPLY),
+    SD_BUS_VTABLE_END};
+
+const sd_bus_vtable kOrientationVtable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_METHOD_WITH_NAMES("SetInterfaceOrientation", "s", SD_BUS_PARAM(orientation), "", "",
+                             BusServiceAccess::setInterfaceOrientation, kMethodFlags),
     SD_BUS_VTABLE_END};
 
 }  // namespace
@@ -307,6 +328,10 @@ int BusService::open(const Options& options) {
   if ((r = sd_bus_add_object_vtable(bus_.get(), objectSlot_.out(), kObjectPath, kInterfaceName, kReportingVtable,
                                     this)) < 0)
     return fail("exporting the object");
+  interfaceOrientation_ = options.interfaceOrientation;
+  if ((r = sd_bus_add_object_vtable(bus_.get(), orientationSlot_.out(), kObjectPath, kOrientationInterfaceName,
+                                    kOrientationVtable, this)) < 0)
+    return fail("exporting the orientation interface");
   if ((r = sd_bus_match_signal(bus_.get(), nameOwnerSlot_.out(), kBusDriver, kBusDriverPath, kBusDriver,
                                "NameOwnerChanged", onNameOwnerChanged, this)) < 0)
     return fail("watching NameOwnerChanged");
@@ -367,6 +392,7 @@ void BusService::close() {
   mailbox_->post([this] {
     lookups_.clear();
     objectSlot_.reset();
+    orientationSlot_.reset();
     nameOwnerSlot_.reset();
     postedSlot_.reset();
     mailboxSource_.reset();

@@ -16,6 +16,7 @@
 #include "vireo/bus_names.h"
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
@@ -28,6 +29,7 @@
 #include "platform/connection.h"
 #include "platform/dbus/bus.h"
 #include "platform/logger.h"
+#include "platform/orientation.h"
 
 namespace vireo {
 class VRReportingServiceProtocol;
@@ -43,6 +45,7 @@ using bus::kObjectPath;
 using bus::kReportingDisabledError;
 using bus::kServiceName;
 inline constexpr const char* kInterfaceName = bus::kInterface;
+inline constexpr const char* kOrientationInterfaceName = bus::kOrientationInterface;
 inline constexpr const char* kDefaultsNotification = bus::kReportingNotification;
 
 // Blocks SIGTERM, SIGINT and SIGHUP in the calling thread (and the threads it makes).
@@ -56,6 +59,8 @@ class BusService {
     std::string address;
     // Handle SIGTERM, SIGINT and SIGHUP in the loop.
     bool handleSignals = true;
+    // Receives the interface orientation that the shell pushes (on the bus thread).
+    std::function<void(Orientation)> interfaceOrientation;
   };
 
   BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications);
@@ -100,7 +105,8 @@ class BusService {
   // runs, and to close() (through the closed mailbox) after it.
   dbus::BusRef bus_;
   dbus::EventRef event_;
-  dbus::SlotRef objectSlot_, nameOwnerSlot_, postedSlot_;
+  dbus::SlotRef objectSlot_, orientationSlot_, nameOwnerSlot_, postedSlot_;
+  std::function<void(Orientation)> interfaceOrientation_;  // set by open(), read on the bus thread
   dbus::EventSourceRef mailboxSource_, termSource_, intSource_, hupSource_;
   std::map<std::string, std::unique_ptr<CredentialLookup>> lookups_;  // by name; bus thread only
   std::thread thread_;  // the loop's thread when start() made one; owner's thread only

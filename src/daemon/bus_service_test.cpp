@@ -197,11 +197,15 @@ TEST_F(BusServiceTest, TheNameCanBeOwnedOnce) {
             std::string::npos);
 }
 
-// The interface block of an introspection document, whitespace dropped.
-std::string interfaceBlock(std::string xml) {
+// Our interfaces' blocks of an introspection document, whitespace dropped.
+std::string interfaceBlocks(std::string xml) {
   std::erase_if(xml, [](unsigned char c) { return std::isspace(c); });
-  auto begin = xml.find(std::string("<interfacename=\"") + kInterfaceName + "\">");
-  return begin == std::string::npos ? "" : xml.substr(begin, xml.find("</interface>", begin) - begin);
+  std::string blocks;
+  for (const char* name : {kInterfaceName, kOrientationInterfaceName}) {
+    auto begin = xml.find(std::string("<interfacename=\"") + name + "\">");
+    blocks += begin == std::string::npos ? "" : xml.substr(begin, xml.find("</interface>", begin) - begin);
+  }
+  return blocks;
 }
 
 TEST_F(BusServiceTest, LiveIntrospectionMatchesTheInstalledInterface) {
@@ -215,9 +219,10 @@ TEST_F(BusServiceTest, LiveIntrospectionMatchesTheInstalledInterface) {
   ASSERT_GE(sd_bus_message_read(reply.get(), "s", &live), 0);
   std::ifstream file(VIREO_INTERFACE_XML);
   ASSERT_TRUE(file) << VIREO_INTERFACE_XML;
-  auto expected = interfaceBlock(std::string(std::istreambuf_iterator<char>(file), {}));
+  auto expected = interfaceBlocks(std::string(std::istreambuf_iterator<char>(file), {}));
   EXPECT_NE(expected.find("<methodname=\"CreateReportingSession\">"), std::string::npos);
-  EXPECT_EQ(interfaceBlock(live), expected) << live;
+  EXPECT_NE(expected.find("<methodname=\"SetInterfaceOrientation\">"), std::string::npos);
+  EXPECT_EQ(interfaceBlocks(live), expected) << live;
 }
 
 }  // namespace

@@ -11,6 +11,7 @@
 #include "daemon/bus_choice.h"
 #include "daemon/bus_service.h"
 #include "daemon/notification_center.h"
+#include "daemon/orientation_service.h"
 #include "dispatch/thread_pool.h"
 #include "platform/linux/defaults_store.h"
 #include "platform/linux/device_properties.h"
@@ -105,11 +106,16 @@ int main(int argc, char** argv) {
   linux_platform::LinuxDiagnosticFiles files(directories.logs);
   linux_platform::StatsTreeLibrary driverStats(directories.runtime + "/stats");
   ExitProcessControl process([&store] { store.store->flush(kKillFlushBudget); });
+  // After the pool, so that it goes first: its handlers hold sessions.
+  daemon::SensorOrientationService orientation(*logger);
+  orientation.start();
 
   Platform platform{*logger,  tracer,        clock,  random,    dispatcher,  store.telemetry, store.analytics,
-                    store.energyLog, defaults, notifications, device, processes, files, driverStats, process};
+                    store.energyLog, defaults, notifications, device, processes, files, driverStats, process,
+                    orientation};
   // The pool's closures use everything above: it stops before any of it goes away.
   auto finish = [&](int status) {
+    orientation.stop();
     if (!dispatcher.drain(kDrainBudget))
       VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Default, "main", "queued work still running after %lld ms",
              static_cast<long long>(std::chrono::milliseconds(kDrainBudget).count()));
@@ -127,6 +133,7 @@ int main(int argc, char** argv) {
 
   daemon::BusService service(*logger, *delegate, notifications);
   daemon::BusService::Options options;
+  options.interfaceOrientation = [&orientation](Orientation o) { orientation.pushInterfaceOrientation(o); };
   options.bus = daemon::chooseBus(std::getenv("VIREO_BUS"), std::getenv("DBUS_STARTER_BUS_TYPE"), geteuid() == 0);
   if (service.open(options) < 0) return finish(1);
 

@@ -7,7 +7,7 @@
 namespace vireo {
 
 // The component scopes; DefaultLog is the platform's default log, used by lines
-// that the design writes outside any scope.
+// that are written outside any scope.
 enum class LogScope { Server, Session, Driver, DefaultLog };
 enum class LogLevel { Default, Info, Error, Debug };
 
@@ -30,7 +30,7 @@ const char* scopeCategory(LogScope scope); // "vrrs", "vrrr", "vrrd", "default"
 
 }  // namespace vireo
 
-// VR_LOG(logger, scope, level, label, fmt, ...): label is the design's method label.
+// VR_LOG(logger, scope, level, label, fmt, ...): label is the method's label as logged.
 #define VR_LOG(logger, scope, level, label, ...) \
   ::vireo::logFormat((logger), (scope), (level), __FILE_NAME__, __LINE__, (label), __VA_ARGS__)
 // Debug lines are written only when their scope is verbose; arguments are not evaluated otherwise.

@@ -10,6 +10,7 @@
 #include "platform/driver_stats.h"
 #include "platform/event_sinks.h"
 #include "platform/logger.h"
+#include "platform/orientation.h"
 #include "platform/telemetry_service.h"
 #include "platform/tracer.h"
 
@@ -31,6 +32,7 @@ struct Platform {
   DiagnosticFiles& files;
   DriverStatsLibrary& driverStats;
   ProcessControl& process;
+  OrientationService& orientation;
 };
 
 }  // namespace vireo

@@ -98,6 +98,7 @@ void VRReportingSession::start() {
     serviceName = serviceName_;
   }
   env_->platform.tracer.emit(trace::kSessionStart);
+  if (shouldReportOrientation()) registerOrientationHandlers();
 
   bool backendFound = skylarkReportingSessionStarted_.load();
   skylarkReportingQueue_->async([self = shared_from_this(), userInfo = std::move(userInfo),
@@ -110,6 +111,8 @@ void VRReportingSession::stop() {
   Logger& logger = env_->logger();
   VR_DEBUG(logger, LogScope::Session, "-[VRReportingSession stop]", "ending session %lli",
            static_cast<long long>(reporterID_));
+  // Runs whether or not the session is started.
+  unregisterOrientationHandlers();
   if (!started_.load()) return;
   VR_DEBUG(logger, LogScope::Session, "-[VRReportingSession stop]", "ending session %lli",
            static_cast<long long>(reporterID_));
@@ -375,6 +378,16 @@ Dictionary VRReportingSession::messageTypeCounts() const {
 std::string VRReportingSession::serviceName() const {
   std::lock_guard<std::mutex> guard(fieldsLock_);
   return serviceName_;
+}
+
+std::optional<std::string> VRReportingSession::orientationCallbackID() const {
+  std::lock_guard<std::mutex> guard(fieldsLock_);
+  return orientationCallbackID_;
+}
+
+std::optional<WallTime> VRReportingSession::startDate() const {
+  std::lock_guard<std::mutex> guard(fieldsLock_);
+  return startDate_;
 }
 
 std::shared_ptr<TelemetrySession> VRReportingSession::skylarkReportingSession() const {

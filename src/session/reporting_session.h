@@ -18,6 +18,8 @@
 #include "base/value.h"
 #include "dispatch/dispatch.h"
 #include "drivers/driver_utility.h"
+#include "platform/clock.h"
+#include "platform/orientation.h"
 #include "platform/telemetry_service.h"
 #include "service/reporting_protocol.h"
 
@@ -59,6 +61,8 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
   std::string messageIdForCategory(std::uint32_t category, std::uint16_t type);
   // createSummaryEventForSession
   std::optional<Dictionary> createSummaryEventForSession();
+  // shouldReportOrientation: internal builds, service types 7 and 2, any device class but 6.
+  bool shouldReportOrientation();
 
   // sendSingleMessage:category:type:serviceType:userInfo:reply: (class operation)
   static void sendSingleMessage(const std::shared_ptr<ReportingEnvironment>& env, const Dictionary& message,
@@ -80,6 +84,8 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
   std::shared_ptr<AggregatedPayloads> aggregatedPayloadData() const;
   Dictionary messageTypeCounts() const;
   std::string serviceName() const;
+  std::optional<std::string> orientationCallbackID() const;
+  std::optional<WallTime> startDate() const;
   std::shared_ptr<TelemetrySession> skylarkReportingSession() const;
   std::shared_ptr<HierarchyToken> skylarkReportingAgentToken() const;
   const std::shared_ptr<SerialQueue>& skylarkReportingQueue() const { return skylarkReportingQueue_; }
@@ -92,6 +98,10 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
                      std::vector<std::int32_t> processIdentifiers);
   // The backend-session closure run on skylarkReportingQueue after start.
   void startBackendSession(const Dictionary& userInfo, const std::string& serviceName, bool backendFound);
+  // The orientation handlers registered at start; mode is "device" or "ui".
+  void registerOrientationHandlers();
+  void unregisterOrientationHandlers();
+  void orientationChanged(const char* mode, Orientation orientation);
   void deliver(const Dictionary& cleaned, const Value& received, bool submittedWhileStarted,
                std::uint32_t category, std::uint16_t type);
 
@@ -113,6 +123,8 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
   std::shared_ptr<AggregatedPayloads> aggregatedPayloadData_;
   Dictionary messageTypeCounts_;
   std::string serviceName_ = "unknown";
+  std::optional<std::string> orientationCallbackID_;
+  std::optional<WallTime> startDate_;
   std::shared_ptr<TelemetrySession> skylarkReportingSession_;
   std::shared_ptr<HierarchyToken> skylarkReportingAgentToken_;
 };

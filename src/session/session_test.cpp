@@ -92,6 +92,7 @@ TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
   s->start();
   EXPECT_TRUE(p.logger.contains("42 is already started"));
   EXPECT_EQ(s->aggregatedPayloadData(), array);
+  EXPECT_TRUE(p.orientation.calls().empty());  // not an internal build
   EXPECT_TRUE(p.telemetry.created().empty());  // only on the session's queue
   // Submitted before the backend closure has run: must wait behind it.
   std::optional<bool> reply;
@@ -325,6 +326,56 @@ TEST_F(SessionTest, SummaryFilesOnInternalBuilds) {
   withPayloads(2, {Dictionary{{"a", 1}}})->createSummaryEventForSession();
   EXPECT_TRUE(p.logger.contains("can't create logging directory at /fake/logs/Audio/Reporting: denied"));
   EXPECT_TRUE(p.logger.contains("jsonOutput writeToURL: denied"));
+}
+
+TEST_F(SessionTest, OrientationChangesAreRecordedWhileAnInternalTelephonySessionRuns) {
+  using namespace std::chrono_literals;
+  p.setInternalBuild(true);
+  auto& orientation = p.orientation;
+  auto s = make(2);
+  Dictionary config{{"HostApplicationDisplayID", "phone"}};
+  s->setConfiguration(&config);
+  s->start();
+  EXPECT_EQ(orientation.calls(),
+            (std::vector<std::string>{"register device VRReportingService 42", "register ui VRReportingService 42"}));
+  EXPECT_EQ(s->orientationCallbackID(), "VRReportingService 42");
+  ASSERT_TRUE(s->startDate().has_value());
+
+  p.clock.advance(1234400us);
+  orientation.fire(orientation.device, Orientation::LeftUp);
+  p.clock.advance(59765600us);  // 61.0 s after start
+  orientation.fire(orientation.ui, Orientation::Normal);
+  auto late = orientation.device()["VRReportingService 42"];
+  EXPECT_EQ(entries(*s), (Array{Dictionary{{"device_orientation", "left-up"}, {"device_orientation_time", 1.234}},
+                                Dictionary{{"ui_orientation", "normal"}, {"ui_orientation_time", 61.0}}}));
+  EXPECT_TRUE(p.logger.contains(
+      "Orientation handler callback mode=device orientation=\"left-up\" app=\"phone\", time=1.234, "
+      "id=\"VRReportingService 42\""));
+
+  s->stop();
+  EXPECT_EQ(orientation.calls().size(), 4u);
+  EXPECT_EQ(orientation.calls()[2], "unregister device VRReportingService 42");
+  EXPECT_EQ(orientation.calls()[3], "unregister ui VRReportingService 42");
+  EXPECT_FALSE(s->orientationCallbackID().has_value());
+  late(Orientation::RightUp);  // in flight when stop dropped the payloads: nothing recorded
+  p.dispatcher.runAll();
+  const Dictionary summary = p.telemetry.lastSession()->sent().back().payload;
+  EXPECT_EQ(*summary.find("device_orientation"), Value("left-up"));
+  EXPECT_EQ(*summary.find("ui_orientation_time"), Value("61"));
+
+  // Not internal, another service type, the excluded device class: nothing registered, no start date.
+  struct Case { bool internal; std::uint16_t type; std::optional<std::int32_t> deviceClass; bool reports; };
+  for (const Case& c : {Case{true, 7, 5, true}, Case{true, 7, 6, false}, Case{true, 0, {}, false}}) {
+    SCOPED_TRACE(c.type);
+    orientation.calls.set({});
+    p.device.deviceClass.set(c.deviceClass);
+    auto other = make(c.type, 7);
+    other->start();
+    EXPECT_EQ(other->startDate().has_value(), c.reports);
+    EXPECT_EQ(orientation.calls().size(), c.reports ? 2u : 0u);
+    other->stop();
+    EXPECT_EQ(orientation.calls().size(), c.reports ? 4u : 0u);
+  }
 }
 
 }  // namespace

@@ -357,13 +357,16 @@ struct FakeNotificationService : NotificationService {
   Recorder<Registration> registrations_;
 };
 
-// Answers only "InternalBuild", when set.
+// Answers "InternalBuild" and "DeviceClassNumber", when set.
 struct FakeDeviceProperties : DeviceProperties {
   std::optional<bool> boolAnswer(std::string_view key) override {
     return key == "InternalBuild" ? internalBuild() : std::nullopt;
   }
-  std::optional<std::int32_t> intAnswer(std::string_view) override { return std::nullopt; }
+  std::optional<std::int32_t> intAnswer(std::string_view key) override {
+    return key == "DeviceClassNumber" ? deviceClass() : std::nullopt;
+  }
   Locked<std::optional<bool>> internalBuild;
+  Locked<std::optional<std::int32_t>> deviceClass;
 };
 
 // This process is 4242 "vireod"; other names are set by the test.
@@ -449,6 +452,40 @@ struct FakeProcessControl : ProcessControl {
   [[noreturn]] void exitProcess(int status) override { throw status; }  // a test may catch the status
 };
 
+// Keeps the registered handlers; a test calls them as the service's thread would.
+// calls records "register device ID", "unregister ui ID", ... in order.
+struct FakeOrientationService : OrientationService {
+  using Handlers = std::map<std::string, OrientationHandler>;
+  void registerDeviceOrientationHandler(const std::string& id, OrientationHandler h) override {
+    calls.add("register device " + id);
+    device.with([&](Handlers& m) { m[id] = std::move(h); });
+  }
+  void registerInterfaceOrientationHandler(const std::string& id, OrientationHandler h) override {
+    calls.add("register ui " + id);
+    ui.with([&](Handlers& m) { m[id] = std::move(h); });
+  }
+  void unregisterDeviceOrientationHandler(const std::string& id) override {
+    calls.add("unregister device " + id);
+    drop(device, id);
+  }
+  void unregisterInterfaceOrientationHandler(const std::string& id) override {
+    calls.add("unregister ui " + id);
+    drop(ui, id);
+  }
+  // Calls every handler of the kind with the orientation.
+  static void fire(const Locked<Handlers>& handlers, Orientation o) {
+    for (auto& [id, h] : handlers()) h(o);
+  }
+  static void drop(Locked<Handlers>& handlers, const std::string& id) {
+    OrientationHandler old;  // may own a session: let it go outside the lock
+    handlers.with([&](Handlers& m) {
+      if (auto it = m.find(id); it != m.end()) old = std::move(it->second), m.erase(it);
+    });
+  }
+  Recorder<std::string> calls;
+  Locked<Handlers> device, ui;
+};
+
 // Owns one fake of each interface. Held closures are dropped first on destruction,
 // while the fakes they may reach are still alive.
 struct FakePlatform {
@@ -466,6 +503,7 @@ struct FakePlatform {
   FakeDiagnosticFiles files;
   FakeDriverStats driverStats;
   FakeProcessControl process;
+  FakeOrientationService orientation;
   ManualDispatcher dispatcher;
 
   Platform platform = over(dispatcher);
@@ -476,13 +514,15 @@ struct FakePlatform {
     telemetry.dropHeld();
     notifications.clear();
     dispatcher.clear();
+    orientation.device.set({});
+    orientation.ui.set({});
   }
 
   void setInternalBuild(bool internal) { device.internalBuild.set(internal); }
   // These fakes over another dispatcher (the thread tests use the real pool).
   Platform over(Dispatcher& d) {
     return {logger,        tracer, clock,     random, d,           telemetry, analytics, energyLog, defaults,
-            notifications, device, processes, files,  driverStats, process};
+            notifications, device, processes, files,  driverStats, process,   orientation};
   }
 };
 

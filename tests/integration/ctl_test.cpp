@@ -108,6 +108,12 @@ TEST_F(CtlTest, SequencesScriptsStoreQueriesAndTheReportingSwitch) {
   ASSERT_EQ(ctl({"defaults", "delete", "disable_reporting"}).status, 0);
   ASSERT_EQ(ctl({"notify"}).status, 0);
   EXPECT_TRUE(eventually([&] { return ctl({"send", "3", "1", "k=1"}).status == 0; }));
+
+  // The shell's interface orientation: only the known texts.
+  EXPECT_EQ(ctl({"orientation", "left-up"}).status, 0);
+  r = ctl({"orientation", "sideways"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_NE(r.text.find("org.freedesktop.DBus.Error.InvalidArgs"), std::string::npos) << r.text;
 }
 
 }  // namespace

@@ -95,10 +95,7 @@ void ChildProcess::stop() {
   }
 }
 
-namespace {
-
-// Starts a session dbus-daemon listening in dir and returns its address.
-std::string startBus(ChildProcess& bus, const std::string& dir) {
+std::string ServiceTest::startPrivateBus(ChildProcess& bus, const std::string& dir) {
   int fd = -1;
   if (!bus.start({"/usr/bin/dbus-daemon", "--session", "--nofork", "--print-address",
                   "--address=unix:dir=" + dir},
@@ -111,8 +108,6 @@ std::string startBus(ChildProcess& bus, const std::string& dir) {
   return address;
 }
 
-}  // namespace
-
 void ServiceTest::SetUp() {
   char tmpl[] = "/tmp/vireo-itest-XXXXXX";
   ASSERT_TRUE(mkdtemp(tmpl));
@@ -123,20 +118,24 @@ void ServiceTest::SetUp() {
   runtimeDir_ = dir_ + "/run";
   for (const auto& d : {configDir_, stateDir_, logsDir_, runtimeDir_}) fs::create_directories(d);
   daemonLog_ = dir_ + "/vireo-reportingd.log";
-  busAddress_ = startBus(bus_, dir_);
+  busAddress_ = startPrivateBus(bus_, dir_);
   ASSERT_FALSE(busAddress_.empty()) << "dbus-daemon did not start";
+  systemBusAddress_ = "unix:path=" + dir_ + "/no-system-bus";
   for (const auto& [name, text] : configurationFiles()) writeFile(configDir_ + "/" + name, text);
   prepareRuntimeDirectory(runtimeDir_);
-  ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH},
-                            {{"CONFIGURATION_DIRECTORY", configDir_},
-                             {"STATE_DIRECTORY", stateDir_},
-                             {"LOGS_DIRECTORY", logsDir_},
-                             {"RUNTIME_DIRECTORY", runtimeDir_},
-                             {"VIREO_BUS", "session"},
-                             {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
-                             {"DBUS_STARTER_BUS_TYPE", ""},
-                             {"JOURNAL_STREAM", ""}},
-                            daemonLog_));
+  beforeDaemonStarts();
+  if (HasFatalFailure()) return;
+  std::map<std::string, std::string> env{{"CONFIGURATION_DIRECTORY", configDir_},
+                                         {"STATE_DIRECTORY", stateDir_},
+                                         {"LOGS_DIRECTORY", logsDir_},
+                                         {"RUNTIME_DIRECTORY", runtimeDir_},
+                                         {"VIREO_BUS", "session"},
+                                         {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
+                                         {"DBUS_SYSTEM_BUS_ADDRESS", systemBusAddress_},
+                                         {"DBUS_STARTER_BUS_TYPE", ""},
+                                         {"JOURNAL_STREAM", ""}};
+  for (const auto& [k, v] : daemonEnvironment()) env[k] = v;
+  ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH}, env, daemonLog_));
   auto probe = client::Client::connectAddress(busAddress_);
   ASSERT_TRUE(probe) << probe.error().message;
   bool up = eventually([&] { return bool((*probe)->ping()) || !daemon_.running(); }, 20s);

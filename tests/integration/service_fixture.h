@@ -50,6 +50,12 @@ class ServiceTest : public ::testing::Test {
   // Files written before the daemon starts (relative to the configuration directory).
   virtual std::map<std::string, std::string> configurationFiles() { return {}; }
   virtual void prepareRuntimeDirectory(const std::string& /*runtime*/) {}
+  // Runs after the buses and directories exist, before the daemon starts.
+  virtual void beforeDaemonStarts() {}
+  // Added to (or, when empty, removed from) the daemon's environment.
+  virtual std::map<std::string, std::string> daemonEnvironment() { return {}; }
+  // Starts a dbus-daemon of its own listening in dir; returns its address.
+  static std::string startPrivateBus(ChildProcess& bus, const std::string& dir);
 
   std::unique_ptr<client::Client> connect();
   static void writeFile(const std::string& path, const std::string& text);
@@ -73,6 +79,8 @@ class ServiceTest : public ::testing::Test {
 
   std::string dir_;  // removed after the test unless VIREO_KEEP_TEST_DIRS is set
   std::string busAddress_;
+  // The daemon's system bus: by default an address where nothing listens.
+  std::string systemBusAddress_;
   std::string configDir_, stateDir_, logsDir_, runtimeDir_;
   ChildProcess bus_;
   ChildProcess daemon_;

@@ -145,6 +145,9 @@ class Client {
 
   // Posts the notification (the Posted(s) signal of com.orvane.Notify1).
   Status postNotification(const std::string& name);
+  // Reports the user interface's orientation ("normal", "bottom-up", "left-up",
+  // "right-up" or "undefined"), as the shell does.
+  Status setInterfaceOrientation(const std::string& orientation);
 
  private:
   explicit Client(std::shared_ptr<detail::Connection> conn);

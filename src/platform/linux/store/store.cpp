@@ -10,7 +10,7 @@ namespace vireo::linux_platform {
 
 namespace {
 
-// The contract's schema, word for word; IF NOT EXISTS lets every start run it.
+// The published schema, word for word; IF NOT EXISTS lets every start run it.
 constexpr const char* kSchema = R"sql(
 CREATE TABLE IF NOT EXISTS telemetry_sessions (
   id           INTEGER PRIMARY KEY,

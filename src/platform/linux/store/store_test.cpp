@@ -62,8 +62,8 @@ struct StoreTest : ::testing::Test {
   std::string db() const { return state() + "/vireo.db"; }
 };
 
-// Name, type, NOT NULL and PRIMARY KEY of each column, as the contract's tables have them.
-TEST_F(StoreTest, CreatesTheContractSchemaInWalModeAndRowsShowWithinASecond) {
+// Name, type, NOT NULL and PRIMARY KEY of each column, as the published schema has them.
+TEST_F(StoreTest, CreatesThePublishedSchemaInWalModeAndRowsShowWithinASecond) {
   LocalStore store(state(), logger, clock);
   ASSERT_TRUE(store.usable());
   EXPECT_EQ(std::filesystem::status(state()).permissions() & std::filesystem::perms::all, std::filesystem::perms(0755));
