@@ -1,10 +1,14 @@
 #include "base/value.h"
 
+#include <algorithm>
+#include <bit>
 #include <charconv>
 #include <cmath>
 #include <cstring>
 #include <functional>
-#include <unordered_map>
+#include <limits>
+#include <random>
+#include <stdexcept>
 
 namespace vireo {
 
@@ -195,90 +199,181 @@ namespace {
 // table for each one. Larger dictionaries (a hostile client) get the index.
 constexpr std::size_t kIndexThreshold = 64;
 
-struct ValueHash {
-  std::size_t operator()(const Value* v) const noexcept { return v->hash(); }
+// Keys come from clients, so the index hashes them with a key drawn at start-up
+// (SipHash-1-3): a client cannot choose keys that all land in one slot, as it could
+// with the unkeyed std::hash (identity for integers).
+struct HashKey {
+  std::uint64_t k0, k1;
 };
-struct ValueEq {
-  bool operator()(const Value* a, const Value* b) const noexcept { return *a == *b; }
-};
+
+const HashKey& processHashKey() noexcept {
+  static const HashKey key = []() noexcept {
+    HashKey k{0x0706050403020100ULL, 0x0f0e0d0c0b0a0908ULL};
+    try {
+      std::random_device device;
+      k.k0 ^= (std::uint64_t{device()} << 32) | device();
+      k.k1 ^= (std::uint64_t{device()} << 32) | device();
+    } catch (...) {
+      // No entropy source: the address of this code still varies with ASLR.
+      k.k0 ^= reinterpret_cast<std::uintptr_t>(&k);
+    }
+    return k;
+  }();
+  return key;
+}
+
+std::uint64_t sipHash(std::uint64_t salt, const void* bytes, std::size_t n) noexcept {
+  const HashKey& key = processHashKey();
+  std::uint64_t v0 = 0x736f6d6570736575ULL ^ key.k0 ^ salt, v1 = 0x646f72616e646f6dULL ^ key.k1;
+  std::uint64_t v2 = 0x6c7967656e657261ULL ^ key.k0 ^ salt, v3 = 0x7465646279746573ULL ^ key.k1;
+  auto round = [&] {
+    v0 += v1, v1 = std::rotl(v1, 13), v1 ^= v0, v0 = std::rotl(v0, 32);
+    v2 += v3, v3 = std::rotl(v3, 16), v3 ^= v2;
+    v0 += v3, v3 = std::rotl(v3, 21), v3 ^= v0;
+    v2 += v1, v1 = std::rotl(v1, 17), v1 ^= v2, v2 = std::rotl(v2, 32);
+  };
+  const auto* p = static_cast<const unsigned char*>(bytes);
+  const std::size_t whole = n - n % 8;
+  for (std::size_t i = 0; i < whole; i += 8) {
+    std::uint64_t m;
+    std::memcpy(&m, p + i, 8);
+    v3 ^= m, round(), v0 ^= m;
+  }
+  std::uint64_t last = std::uint64_t{n} << 56;
+  for (std::size_t i = whole; i < n; ++i) last |= std::uint64_t{p[i]} << (8 * (i - whole));
+  v3 ^= last, round(), v0 ^= last;
+  v2 ^= 0xff, round(), round(), round();
+  return v0 ^ v1 ^ v2 ^ v3;
+}
+
+// Key identity: == except that all NaNs are one key, inside container keys too.
+bool sameKey(const Value& a, const Value& b) noexcept {
+  if (a.kind() != b.kind()) return false;
+  switch (a.kind()) {
+    case Value::Kind::Double: {
+      const double x = *a.asDouble(), y = *b.asDouble();
+      return x == y || (std::isnan(x) && std::isnan(y));
+    }
+    case Value::Kind::Array: {
+      const Array &x = *a.asArray(), &y = *b.asArray();
+      return x.size() == y.size() && std::equal(x.begin(), x.end(), y.begin(), sameKey);
+    }
+    case Value::Kind::Dictionary: {
+      const Dictionary &x = *a.asDictionary(), &y = *b.asDictionary();
+      return x.size() == y.size() && std::equal(x.begin(), x.end(), y.begin(), [](const auto& e, const auto& f) {
+               return sameKey(e.first, f.first) && sameKey(e.second, f.second);
+             });
+    }
+    default: return a == b;
+  }
+}
+
+// Consistent with sameKey: equal keys hash alike.
+std::uint64_t keyHash(const Value& v) noexcept {
+  const std::uint64_t salt = static_cast<std::uint64_t>(v.kind()) + 1;
+  auto ofScalar = [salt](auto x) { return sipHash(salt, &x, sizeof x); };
+  auto combine = [salt](std::uint64_t h, std::uint64_t next) {
+    const std::uint64_t pair[2] = {h, next};
+    return sipHash(salt, pair, sizeof pair);
+  };
+  switch (v.kind()) {
+    case Value::Kind::Absent: return sipHash(salt, nullptr, 0);
+    case Value::Kind::Bool: return ofScalar(*v.asBool());
+    case Value::Kind::Int: return ofScalar(*v.asInt());
+    case Value::Kind::UInt: return ofScalar(*v.asUInt());
+    case Value::Kind::Double: {
+      double d = *v.asDouble();
+      if (std::isnan(d)) d = std::numeric_limits<double>::quiet_NaN();
+      if (d == 0) d = 0.0;  // -0.0 too
+      return ofScalar(d);
+    }
+    case Value::Kind::String: return sipHash(salt, v.asString()->data(), v.asString()->size());
+    case Value::Kind::Data: return sipHash(salt, v.asData()->data(), v.asData()->size());
+    case Value::Kind::Array: {
+      std::uint64_t h = salt;
+      for (const Value& item : *v.asArray()) h = combine(h, keyHash(item));
+      return h;
+    }
+    case Value::Kind::Dictionary: {
+      std::uint64_t h = salt;
+      for (const auto& [key, item] : *v.asDictionary()) h = combine(combine(h, keyHash(key)), keyHash(item));
+      return h;
+    }
+  }
+  return salt;
+}
+
+std::uint32_t slotHash(const Value& key) noexcept {
+  const std::uint64_t h = keyHash(key);
+  return static_cast<std::uint32_t>(h ^ (h >> 32));
+}
 }  // namespace
 
-struct Dictionary::Index {
-  // Points into entries_; rebuilt whenever entries_ may have reallocated.
-  std::unordered_map<const Value*, std::size_t, ValueHash, ValueEq> positions;
-  const Entry* base = nullptr;
-};
-
-void Dictionary::IndexDeleter::operator()(Index* index) const noexcept { delete index; }
-
 Dictionary::Dictionary(std::initializer_list<Entry> entries) {
+  reserve(entries.size());
   for (const auto& e : entries) set(e.first, e.second);
 }
-Dictionary::Dictionary(const Dictionary& other) : entries_(other.entries_) {}
-Dictionary::Dictionary(Dictionary&& other) noexcept : entries_(std::move(other.entries_)) {
-  other.index_.reset();
-}
-Dictionary& Dictionary::operator=(const Dictionary& other) {
-  if (this != &other) {
-    entries_ = other.entries_;
-    index_.reset();
-  }
-  return *this;
-}
-Dictionary& Dictionary::operator=(Dictionary&& other) noexcept {
-  if (this != &other) {
-    entries_ = std::move(other.entries_);
-    index_.reset();
-    other.index_.reset();
-  }
-  return *this;
-}
-Dictionary::~Dictionary() = default;
 
-void Dictionary::rebuildIndex() const {
-  if (!index_) index_.reset(new Index);
-  index_->positions.clear();
-  index_->positions.reserve(entries_.size() * 2);
-  for (std::size_t i = 0; i < entries_.size(); ++i) index_->positions.emplace(&entries_[i].first, i);
-  index_->base = entries_.data();
+void Dictionary::reserve(std::size_t n) {
+  entries_.reserve(n);
+  if (n >= kIndexThreshold && slots_.size() < 2 * n) growIndex(std::bit_ceil(2 * n));
 }
 
-std::size_t Dictionary::indexOf(const Value& key) const noexcept {
-  if (entries_.size() < kIndexThreshold) {
+// Rebuilds the table at capacity (a power of two); strong guarantee.
+void Dictionary::growIndex(std::size_t capacity) {
+  std::vector<Slot> grown(capacity, Slot{0, 0});
+  const std::size_t mask = capacity - 1;
+  auto place = [&](Slot slot) {
+    std::size_t i = slot.hash & mask;
+    while (grown[i].position != 0) i = (i + 1) & mask;
+    grown[i] = slot;
+  };
+  if (slots_.empty()) {
     for (std::size_t i = 0; i < entries_.size(); ++i)
-      if (entries_[i].first == key) return i;
+      place(Slot{slotHash(entries_[i].first), static_cast<std::uint32_t>(i + 1)});
+  } else {
+    for (const Slot& slot : slots_)
+      if (slot.position != 0) place(slot);
+  }
+  slots_.swap(grown);
+}
+
+std::size_t Dictionary::indexOf(const Value& key, std::uint32_t hash) const noexcept {
+  if (slots_.empty()) {
+    for (std::size_t i = 0; i < entries_.size(); ++i)
+      if (sameKey(entries_[i].first, key)) return i;
     return entries_.size();
   }
-  try {
-    if (!index_ || index_->base != entries_.data() || index_->positions.size() != entries_.size()) rebuildIndex();
-    auto it = index_->positions.find(&key);
-    return it == index_->positions.end() ? entries_.size() : it->second;
-  } catch (...) {
-    index_.reset();
-    for (std::size_t i = 0; i < entries_.size(); ++i)
-      if (entries_[i].first == key) return i;
-    return entries_.size();
+  const std::size_t mask = slots_.size() - 1;
+  for (std::size_t i = hash & mask; slots_[i].position != 0; i = (i + 1) & mask) {
+    const Slot& slot = slots_[i];
+    if (slot.hash == hash && sameKey(entries_[slot.position - 1].first, key)) return slot.position - 1;
   }
+  return entries_.size();
 }
 
 const Value* Dictionary::find(const Value& key) const noexcept {
-  auto i = indexOf(key);
+  const auto i = indexOf(key, slots_.empty() ? 0 : slotHash(key));
   return i < entries_.size() ? &entries_[i].second : nullptr;
 }
 
 void Dictionary::set(Value key, Value value) {
-  auto i = indexOf(key);
-  if (i < entries_.size()) {
+  const bool indexed = !slots_.empty() || entries_.size() + 1 >= kIndexThreshold;
+  const std::uint32_t hash = indexed ? slotHash(key) : 0;
+  if (const auto i = indexOf(key, hash); i < entries_.size()) {
     entries_[i].second = std::move(value);
     return;
   }
+  if (entries_.size() >= std::numeric_limits<std::uint32_t>::max() - 1) throw std::length_error("Dictionary");
+  // Make room first, so that a failed allocation leaves the index whole.
+  if (indexed && slots_.size() < 2 * (entries_.size() + 1))
+    growIndex(std::max<std::size_t>(slots_.size() * 2, 4 * kIndexThreshold));
   entries_.emplace_back(std::move(key), std::move(value));
-  if (index_) {
-    if (index_->base == entries_.data())
-      index_->positions.emplace(&entries_.back().first, entries_.size() - 1);
-    else
-      index_.reset();
-  }
+  if (!indexed) return;
+  const std::size_t mask = slots_.size() - 1;
+  std::size_t i = hash & mask;
+  while (slots_[i].position != 0) i = (i + 1) & mask;
+  slots_[i] = Slot{hash, static_cast<std::uint32_t>(entries_.size())};
 }
 
 void Dictionary::merge(const Dictionary& other) {

@@ -87,17 +87,19 @@ class Value {
 
 // Insertion-ordered map from basic values to values. Lookup is linear for small
 // dictionaries and hashed once they grow, so a client cannot make merging quadratic.
+//
+// Keys are the same key when they are ==, with one exception: every NaN double is
+// one key (0.0 and -0.0 already are), so a repeated NaN key replaces the earlier
+// value like any repeated key instead of piling up entries that can never be found.
+//
+// Const access never writes: the index is kept up to date by the mutating calls,
+// so a dictionary shared between threads may be read from all of them at once.
 class Dictionary {
  public:
   using Entry = std::pair<Value, Value>;
 
   Dictionary() = default;
   Dictionary(std::initializer_list<Entry> entries);
-  Dictionary(const Dictionary& other);
-  Dictionary(Dictionary&& other) noexcept;
-  Dictionary& operator=(const Dictionary& other);
-  Dictionary& operator=(Dictionary&& other) noexcept;
-  ~Dictionary();
 
   std::size_t size() const noexcept { return entries_.size(); }
   bool empty() const noexcept { return entries_.empty(); }
@@ -118,20 +120,22 @@ class Dictionary {
   void set(Value key, Value value);
   // Adds every entry of other; later values replace earlier ones under the same key.
   void merge(const Dictionary& other);
-  void reserve(std::size_t n) { entries_.reserve(n); }
+  void reserve(std::size_t n);
 
   friend bool operator==(const Dictionary& a, const Dictionary& b) noexcept;
 
  private:
-  struct Index;
-  struct IndexDeleter {
-    void operator()(Index* index) const noexcept;
+  // An open-addressed slot: the key's hash and 1 + its position in entries_ (0 when
+  // free). Positions, unlike pointers, stay valid in copies and across reallocation.
+  struct Slot {
+    std::uint32_t hash;
+    std::uint32_t position;
   };
-  std::size_t indexOf(const Value& key) const noexcept;
-  void rebuildIndex() const;
+  std::size_t indexOf(const Value& key, std::uint32_t hash) const noexcept;
+  void growIndex(std::size_t capacity);
 
   std::vector<Entry> entries_;
-  mutable std::unique_ptr<Index, IndexDeleter> index_;
+  std::vector<Slot> slots_;  // empty while small; otherwise indexes every entry, at most half full
 };
 
 // JSON writing. Strict mode refuses what strict JSON cannot hold (NaN, infinities,

@@ -3,7 +3,10 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
+#include <cstring>
 #include <limits>
+#include <thread>
+#include <vector>
 
 namespace vireo {
 namespace {
@@ -34,6 +37,90 @@ TEST(Dictionary, OrderKindsAndTheIndexOfLargeDictionaries) {
   Dictionary moved = std::move(copy);
   EXPECT_EQ(*moved.find("new")->asInt(), 1);
   EXPECT_EQ(moved.size(), 1005u);
+}
+
+double nanWithPayload(std::uint64_t payload, bool negative) {
+  const std::uint64_t sign = negative ? 0x8000000000000000ULL : 0;
+  const std::uint64_t bits = sign | 0x7ff8000000000000ULL | (payload & 0x7ffffffffffffULL);
+  double d;
+  std::memcpy(&d, &bits, sizeof d);
+  return d;
+}
+
+// Key identity, checked with a dictionary small enough to be scanned and one big
+// enough to be indexed: both must agree.
+TEST(Dictionary, KeyIdentityIsTheSameScannedAndIndexed) {
+  const double nan = std::numeric_limits<double>::quiet_NaN();
+  const struct {
+    Value a, b;
+    bool same;
+  } cases[] = {
+      {Value(nan), Value(nanWithPayload(12345, true)), true},
+      {Value(0.0), Value(-0.0), true},
+      {Value(Array{nan, "x"}), Value(Array{nanWithPayload(7, false), "x"}), true},
+      {Value(Dictionary{{Value(nan), 1}}), Value(Dictionary{{Value(-nan), 1}}), true},
+      {Value(Data{1, 2}), Value(Data{1, 2}), true},
+      {Value(1), Value(1u), false},
+      {Value(1), Value(1.0), false},
+      {Value("1"), Value(1), false},
+      {Value(nan), Value(std::numeric_limits<double>::infinity()), false},
+      {Value(Data{'a'}), Value("a"), false},
+  };
+  for (std::size_t filler : {0, 200}) {
+    for (const auto& c : cases) {
+      Dictionary d;
+      for (std::size_t i = 0; i < filler; ++i) d.set(Value("filler" + std::to_string(i)), Value(i));
+      d.set(c.a, "a");
+      d.set(c.b, "b");
+      const std::string label = c.a.text() + " then " + c.b.text();
+      EXPECT_EQ(d.size(), filler + (c.same ? 1 : 2)) << label << " filler " << filler;
+      ASSERT_NE(d.find(c.a), nullptr) << label;
+      EXPECT_EQ(*d.find(c.a)->asString(), c.same ? "b" : "a") << label << " filler " << filler;
+      EXPECT_EQ(*d.find(c.b)->asString(), "b") << label;
+      EXPECT_EQ(d[filler].first.text(), c.a.text()) << label;  // the first key stays where it came
+    }
+  }
+}
+
+// Every NaN key is one key, wherever it comes in a big dictionary; order is that of first insertion.
+TEST(Dictionary, ThirtyTwoThousandNaNKeysCollapseToOne) {
+  Dictionary d;
+  d.set("first", 0);
+  for (std::uint64_t i = 0; i < 32000; ++i) {
+    d.set(Value(nanWithPayload(i, i % 2 != 0)), Value(i));
+    if (i % 100 == 0) d.set(Value("k" + std::to_string(i)), Value(i));
+  }
+  ASSERT_EQ(d.size(), 2u + 320u);
+  EXPECT_TRUE(std::isnan(*d[1].first.asDouble()));
+  EXPECT_EQ(*d.find(std::numeric_limits<double>::quiet_NaN())->asUInt(), 31999u);
+  EXPECT_EQ(*d.find("k31900")->asUInt(), 31900u);
+}
+
+// Payload dictionaries are shared copy-on-write between threads: readers of the
+// shared one run while copies are unshared and grown.
+TEST(Dictionary, SharedDictionaryIsReadFromManyThreadsWhileCopiesChange) {
+  Dictionary built;
+  for (int i = 0; i < 1000; ++i) built.set(Value(std::to_string(i)), i);
+  const Value shared{Dictionary(built)};  // a copy, as every unshared container is
+  std::vector<std::thread> threads;
+  std::vector<int> found(4, 0);
+  for (int t = 0; t < 4; ++t)
+    threads.emplace_back([&, t] {
+      const Dictionary& d = *shared.asDictionary();
+      for (int round = 0; round < 5; ++round)
+        for (int i = 0; i < 1000; ++i)
+          found[t] += d.contains(std::to_string(i)) && !d.contains("x" + std::to_string(i));
+    });
+  for (int t = 0; t < 2; ++t)
+    threads.emplace_back([&, t] {
+      for (int round = 0; round < 5; ++round) {
+        Value mine = shared;
+        for (int i = 0; i < 1000; ++i) mine.mutableDictionary()->set(Value("x" + std::to_string(i + t)), round);
+      }
+    });
+  for (auto& thread : threads) thread.join();
+  for (int n : found) EXPECT_EQ(n, 5000);
+  EXPECT_EQ(shared.asDictionary()->size(), 1000u);
 }
 
 TEST(Value, ContainersAreCopyOnWriteAndNumbersConvert) {

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "base/value.h"
+#include "platform/dbus/value_codec.h"
 
 namespace vireo::dbus {
 
@@ -19,7 +20,10 @@ struct SendMessageArguments {
   std::optional<std::vector<std::int64_t>> reporterIDs;
 };
 
-// Returns >0 on success, <0 with error set.
-int readSendMessageArguments(sd_bus_message* m, SendMessageArguments* out, sd_bus_error* error);
+// Returns >0 on success, <0 with error set. The payload is read under limits'
+// bytes and entries, the ax of reporter IDs (addressed or not) under
+// maxReporterIDs; passing one fails with -ENOBUFS and kLimitsExceeded.
+int readSendMessageArguments(sd_bus_message* m, SendMessageArguments* out, sd_bus_error* error,
+                             const DecodeLimits& limits = {});
 
 }  // namespace vireo::dbus

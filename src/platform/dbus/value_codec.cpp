@@ -24,11 +24,27 @@ int failed(sd_bus_error* error, int r) {
   return sd_bus_error_setf(error, kInvalidArgs, "could not read value: %s", std::strerror(-r));
 }
 
+int limitPassed(sd_bus_error* error, const char* format, std::size_t limit) {
+  sd_bus_error_setf(error, kLimitsExceeded, format, limit);
+  return -ENOBUFS;
+}
+
 struct Reader {
   sd_bus_message* m;
   sd_bus_error* error;
+  const DecodeLimits& limits;
   int depth = 0;
   int variants = 0;
+  std::size_t bytes = 0;
+  std::size_t entries = 0;
+
+  // Counts n bytes against the limit before they are copied; bytes never exceeds maxBytes.
+  int charge(std::size_t n) {
+    if (n > limits.maxBytes - bytes)
+      return limitPassed(error, "payload larger than MaxPayloadBytes=%zu", limits.maxBytes);
+    bytes += n;
+    return 1;
+  }
 
   int basic(char type, Value* out) {
     int r = 0;
@@ -38,8 +54,11 @@ struct Reader {
       case 'g': {
         const char* s = nullptr;
         r = sd_bus_message_read_basic(m, type, &s);
-        if (r > 0) *out = Value(s);
-        break;
+        if (r <= 0) break;
+        const std::size_t length = std::strlen(s);
+        if ((r = charge(length)) < 0) return r;
+        *out = Value(std::string(s, length));
+        return 1;
       }
       case 'b': {
         int b = 0;
@@ -102,7 +121,7 @@ struct Reader {
     }
     if (r < 0) return failed(error, r);
     if (r == 0) return sd_bus_error_set(error, kInvalidArgs, "value missing");
-    return 1;
+    return charge(8);
   }
 
   int enterContainer() {
@@ -118,6 +137,8 @@ struct Reader {
     int r = sd_bus_message_peek_type(m, &type, &contents);
     if (r < 0) return failed(error, r);
     if (r == 0) return 0;
+    if (type != 'v' && ++entries > limits.maxEntries)
+      return limitPassed(error, "payload has more than MaxPayloadEntries=%zu values", limits.maxEntries);
     switch (type) {
       case 'v':
         return variant(contents, out);
@@ -153,10 +174,11 @@ struct Reader {
   int array(const char* contents, Value* out) {
     int r = 0;
     if (std::strcmp(contents, "y") == 0) {
-      const void* bytes = nullptr;
+      const void* raw = nullptr;
       std::size_t size = 0;
-      if ((r = sd_bus_message_read_array(m, 'y', &bytes, &size)) < 0) return failed(error, r);
-      auto* p = static_cast<const std::uint8_t*>(bytes);
+      if ((r = sd_bus_message_read_array(m, 'y', &raw, &size)) < 0) return failed(error, r);
+      if ((r = charge(size)) < 0) return r;
+      auto* p = static_cast<const std::uint8_t*>(raw);
       *out = Value(Data(p, p + size));
       return 1;
     }
@@ -319,14 +341,14 @@ int append(sd_bus_message* m, const Value& value, int depth) {
 
 }  // namespace
 
-int readValue(sd_bus_message* m, Value* out, sd_bus_error* error) {
-  Reader reader{m, error};
+int readValue(sd_bus_message* m, Value* out, sd_bus_error* error, const DecodeLimits& limits) {
+  Reader reader{m, error, limits};
   return reader.value(out);
 }
 
-int readDictionary(sd_bus_message* m, Dictionary* out, sd_bus_error* error) {
+int readDictionary(sd_bus_message* m, Dictionary* out, sd_bus_error* error, const DecodeLimits& limits) {
   Value v;
-  int r = readValue(m, &v, error);
+  int r = readValue(m, &v, error, limits);
   if (r < 0) return r;
   // The freshly read value is the container's only owner: moving it out copies nothing.
   Dictionary* dict = r > 0 ? v.mutableDictionary() : nullptr;

@@ -4,9 +4,13 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <cerrno>
+#include <cmath>
 #include <cstring>
+#include <string>
 
 #include "platform/dbus/bus.h"
+#include "platform/dbus/send_message_arguments.h"
 
 namespace vireo::dbus {
 namespace {
@@ -146,6 +150,79 @@ TEST_F(ValueCodecTest, RefusesFileDescriptorsAnywhereAndWrongTypes) {
   BusError error;
   EXPECT_LT(readDictionary(strings.get(), &d, error.get()), 0);
   EXPECT_STREQ(error.name(), kInvalidArgs);
+}
+
+// A client may send the same NaN key over and over: it is one key, and reading
+// stays linear (this took seconds when every NaN was a key of its own).
+TEST_F(ValueCodecTest, ThirtyTwoThousandNaNKeysReadAsOne) {
+  MessageRef m = newMessage();
+  ASSERT_GE(sd_bus_message_open_container(m.get(), 'a', "{dv}"), 0);
+  for (std::int64_t i = 0; i < 32000; ++i) {
+    const double key = i % 2 ? std::nan("") : -std::nan("1");
+    ASSERT_GE(sd_bus_message_append(m.get(), "{dv}", key, "x", i), 0);
+  }
+  ASSERT_GE(sd_bus_message_close_container(m.get()), 0);
+  seal(m);
+  Dictionary d;
+  BusError error;
+  ASSERT_EQ(readDictionary(m.get(), &d, error.get()), 1) << error.message();
+  ASSERT_EQ(d.size(), 1u);
+  EXPECT_EQ(*d[0].second.asInt(), 31999);
+}
+
+// Each limit at its boundary, through SendMessage's arguments. The payload holds
+// 31 bytes (keys 8, "xyz" 3, two integers 16, data 3, "q" 1) in 7 values (the
+// dictionary, its 4 values, the list's 2 items); the call names 3 reporter IDs.
+TEST_F(ValueCodecTest, EachLimitPassesAtItsValueAndRefusesOneBelow) {
+  const Dictionary payload{{"ab", "xyz"}, {"n", 5}, {"d", Data{1, 2, 3}}, {"list", Array{7, "q"}}};
+  const std::int64_t ids[] = {1, 2, 3};
+  const struct {
+    DecodeLimits limits;
+    const char* refusal;  // nullptr: accepted
+  } cases[] = {
+      {{31, 7, 3}, nullptr},
+      {{}, nullptr},
+      {{30, 7, 3}, "payload larger than MaxPayloadBytes=30"},
+      {{31, 6, 3}, "payload has more than MaxPayloadEntries=6 values"},
+      {{31, 7, 2}, "more than MaxReporterIDsPerCall=2 reporter IDs"},
+      {{0, kUnlimited, kUnlimited}, "payload larger than MaxPayloadBytes=0"},
+      {{kUnlimited, 0, kUnlimited}, "payload has more than MaxPayloadEntries=0 values"},
+  };
+  for (const auto& c : cases) {
+    MessageRef m = newMessage();
+    ASSERT_GE(appendStringDictionary(m.get(), payload), 0);
+    ASSERT_GE(sd_bus_message_append(m.get(), "uqb", 7u, std::uint16_t{2}, 1), 0);
+    ASSERT_GE(sd_bus_message_append_array(m.get(), 'x', ids, sizeof ids), 0);
+    seal(m);
+    SendMessageArguments args;
+    BusError error;
+    const int r = readSendMessageArguments(m.get(), &args, error.get(), c.limits);
+    if (!c.refusal) {
+      ASSERT_EQ(r, 1) << error.message();
+      EXPECT_EQ(Value(args.payload), Value(payload));
+      EXPECT_EQ(args.reporterIDs, (std::vector<std::int64_t>{1, 2, 3}));
+      continue;
+    }
+    EXPECT_EQ(r, -ENOBUFS) << c.refusal;
+    EXPECT_STREQ(error.name(), kLimitsExceeded);
+    EXPECT_STREQ(error.message(), c.refusal);
+  }
+}
+
+// The refusals of what is never accepted keep their InvalidArgs whatever the limits.
+TEST_F(ValueCodecTest, LimitsLeaveDescriptorAndDepthRefusalsAlone) {
+  MessageRef fd = newMessage(), deep = newMessage();
+  ASSERT_GE(sd_bus_message_append(fd.get(), "a{sv}", 1, "fd", "h", 0), 0);
+  Value inner("leaf");
+  for (int i = 1; i < 17; ++i) inner = Value(Array{inner});
+  ASSERT_GE(appendStringDictionary(deep.get(), Dictionary{{"k", inner}}), 0);
+  const std::pair<MessageRef*, const char*> cases[] = {{&fd, "file descriptors"}, {&deep, "nested deeper than 16"}};
+  for (const auto& [m, reason] : cases) {
+    seal(*m);
+    Dictionary d;
+    BusError error;
+    expectInvalidArgs(readDictionary(m->get(), &d, error.get(), DecodeLimits{1000, 1000, 1}), error, reason);
+  }
 }
 
 TEST_F(ValueCodecTest, WritingRefusesWhatDBusCannotCarry) {
