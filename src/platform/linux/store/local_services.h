@@ -13,8 +13,10 @@
 namespace vireo::linux_platform {
 
 struct LocalStoreServices {
-  LocalStoreServices(const ServiceDirectories& directories, Logger& logger, Clock& clock)
-      : store(LocalStore::open(directories, logger, clock)),
+  // options carries the limits (limits.conf MaxQueuedRows is Options::maxPendingRows).
+  LocalStoreServices(const ServiceDirectories& directories, Logger& logger, Clock& clock,
+                     LocalStore::Options options = {})
+      : store(LocalStore::open(directories, logger, clock, options)),
         telemetry(store, directories.configuration),
         analytics(store, directories.configuration),
         energyLog(store) {}

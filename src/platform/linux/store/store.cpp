@@ -2,8 +2,10 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <iterator>
 #include <utility>
 
 namespace vireo::linux_platform {
@@ -77,8 +79,26 @@ bool makeDirectories(const std::string& path, std::string* error) {
 }
 
 int bindText(sqlite3_stmt* s, int index, const std::string& text) {
-  return sqlite3_bind_text(s, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+  return sqlite3_bind_text64(s, index, text.data(), text.size(), SQLITE_STATIC, SQLITE_UTF8);
 }
+
+// Errors that belong to the row being written, not to the database: retrying
+// cannot help that row, and its batch-mates can be written without it.
+bool aboutTheRow(int rc) {
+  switch (rc & 0xff) {
+    case SQLITE_CONSTRAINT:
+    case SQLITE_TOOBIG:
+    case SQLITE_MISMATCH:
+    case SQLITE_RANGE:
+      return true;
+    default:
+      return false;
+  }
+}
+
+// Remembered drops: enough for every flush of a normal run, bounded when a
+// client keeps sending rows the database refuses.
+constexpr std::size_t kMaxDropRanges = 256;
 
 }  // namespace
 
@@ -92,6 +112,9 @@ struct LocalStore::Row {
   std::int64_t b = 0;     // type
   double at = 0;
   std::string t1, t2, t3; // JSON columns and names, per kind
+  std::uint64_t number = 0;  // its place in the order rows were handed over, from 1
+  std::size_t size = 0;      // bytes() when handed over
+  bool bad = false;          // refused by the database itself: never written
 
   std::size_t bytes() const { return sizeof(Row) + t1.capacity() + t2.capacity() + t3.capacity(); }
 };
@@ -107,8 +130,9 @@ LocalStore::LocalStore(const std::string& stateDirectory, Logger& logger, Clock&
   writer_ = std::thread([this] { writerLoop(); });
 }
 
-std::shared_ptr<LocalStore> LocalStore::open(const ServiceDirectories& directories, Logger& logger, Clock& clock) {
-  return std::make_shared<LocalStore>(directories.state, logger, clock);
+std::shared_ptr<LocalStore> LocalStore::open(const ServiceDirectories& directories, Logger& logger, Clock& clock,
+                                             Options options) {
+  return std::make_shared<LocalStore>(directories.state, logger, clock, options);
 }
 
 LocalStore::~LocalStore() { close(); }
@@ -200,44 +224,54 @@ std::string LocalStore::jsonObject(const Dictionary& d) {
   return json ? std::move(*json) : std::string("{}");
 }
 
+bool LocalStore::refuse() {
+  std::lock_guard lock(mutex_);
+  ++refusedRows_;
+  return false;
+}
+
 bool LocalStore::enqueue(Row&& row) {
-  if (!usable()) return false;
-  const std::size_t bytes = row.bytes();
-  const std::size_t half = options_.maxPendingBytes / 2;
-  bool accepted = false;
+  if (!usable()) return refuse();
+  row.size = row.bytes();
   bool wake = false;
   bool logOverflow = false;
+  std::uint64_t rows = 0;
+  std::uint64_t bytes = 0;
   {
     std::lock_guard lock(mutex_);
-    if (stopping_) return false;
-    if (queueBytes_ + bytes > options_.maxPendingBytes) {
-      logOverflow = !overflowLogged_;
-      overflowLogged_ = true;
+    if (stopping_) {
+      ++refusedRows_;
+      return false;
+    }
+    if (pendingRows_ + 1 > options_.maxPendingRows || pendingBytes_ + row.size > options_.maxPendingBytes) {
+      ++refusedRows_;
+      if (overflowing_) return false;
+      overflowing_ = logOverflow = true;
+      rows = pendingRows_;
+      bytes = pendingBytes_;
     } else {
-      // The writer sleeps until the first row, then gathers for an interval
-      // unless the queue grows past half its budget.
-      if (queue_.empty()) {
-        firstPending_ = std::chrono::steady_clock::now();
-        wake = true;
-      }
-      wake = wake || (queueBytes_ < half && queueBytes_ + bytes >= half);
-      queueBytes_ += bytes;
+      row.number = ++enqueued_;
+      ++pendingRows_;
+      pendingBytes_ += row.size;
+      // The writer sleeps only on an empty queue; while it writes or pauses after
+      // a failure it picks the rows up by itself.
+      wake = queue_.empty();
       queue_.push_back(std::move(row));
-      ++enqueued_;
-      accepted = true;
     }
   }
   if (logOverflow) {
     VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::enqueue",
-           "%s: writer queue full, dropping rows", path_.c_str());
+           "%s: writer queue full, refusing rows (%llu rows, %llu bytes pending)", path_.c_str(),
+           static_cast<unsigned long long>(rows), static_cast<unsigned long long>(bytes));
+    return false;
   }
   if (wake) wake_.notify_one();
-  return accepted;
+  return true;
 }
 
 std::optional<std::int64_t> LocalStore::insertTelemetrySession(const Dictionary& sessionInfo,
                                                                const Dictionary& userInfo, double createdAt) {
-  if (!usable()) return std::nullopt;
+  if (!usable()) return refuse(), std::nullopt;
   Row row;
   row.kind = Row::Kind::Session;
   row.id = nextSessionId_.fetch_add(1);
@@ -274,7 +308,7 @@ bool LocalStore::setFlushed(std::int64_t sessionId, double flushedAt) {
 bool LocalStore::insertTelemetryMessage(std::optional<std::int64_t> session, const Dictionary* sessionInfo,
                                         const Dictionary* userInfo, std::int64_t category, std::int64_t type,
                                         const Dictionary& payload, double sentAt) {
-  if (!usable()) return false;
+  if (!usable()) return refuse();
   Row row;
   row.kind = Row::Kind::Message;
   row.hasId = session.has_value();
@@ -291,7 +325,7 @@ bool LocalStore::insertTelemetryMessage(std::optional<std::int64_t> session, con
 }
 
 bool LocalStore::insertAnalyticsEvent(std::string_view name, const Dictionary& payload, double at) {
-  if (!usable()) return false;
+  if (!usable()) return refuse();
   Row row;
   row.kind = Row::Kind::Analytics;
   row.t1 = std::string(name);
@@ -302,7 +336,7 @@ bool LocalStore::insertAnalyticsEvent(std::string_view name, const Dictionary& p
 
 bool LocalStore::insertEnergyEvent(std::int64_t client, std::string_view name, const Dictionary& payload,
                                    double at) {
-  if (!usable()) return false;
+  if (!usable()) return refuse();
   Row row;
   row.kind = Row::Kind::Energy;
   row.a = client;
@@ -312,15 +346,22 @@ bool LocalStore::insertEnergyEvent(std::int64_t client, std::string_view name, c
   return enqueue(std::move(row));
 }
 
-bool LocalStore::flush(std::chrono::milliseconds timeout) {
+std::uint64_t LocalStore::handedOver() const {
+  std::lock_guard lock(mutex_);
+  return enqueued_;
+}
+
+bool LocalStore::flush(std::chrono::milliseconds timeout, std::uint64_t since) {
   if (!usable()) return false;
   std::unique_lock lock(mutex_);
   const std::uint64_t target = enqueued_;
-  if (processedRows_ >= target) return lastWriteOk_;
-  if (flushTarget_ < target) flushTarget_ = target;
-  wake_.notify_one();
   if (!processed_.wait_for(lock, timeout, [&] { return processedRows_ >= target; })) return false;
-  return lastWriteOk_;
+  return !droppedAfter(since, target);
+}
+
+StoreStatus LocalStore::status() const {
+  std::lock_guard lock(mutex_);
+  return StoreStatus{pendingRows_, pendingBytes_, refusedRows_, droppedBadRows_, writeErrors_, lastError_, usable()};
 }
 
 void LocalStore::close() {
@@ -329,6 +370,7 @@ void LocalStore::close() {
     if (closed_) return;
     closed_ = true;
     stopping_ = true;
+    giveUpAt_ = std::chrono::steady_clock::now() + options_.closeTimeout;
   }
   wake_.notify_all();
   if (writer_.joinable()) writer_.join();
@@ -336,114 +378,198 @@ void LocalStore::close() {
   finalizeDatabase();
 }
 
+void LocalStore::noteDropped(std::uint64_t first, std::uint64_t last) {
+  if (!dropped_.empty() && dropped_.back().second + 1 == first) {
+    dropped_.back().second = last;
+    return;
+  }
+  dropped_.emplace_back(first, last);
+  if (dropped_.size() > kMaxDropRanges) {
+    // A flush reaching back this far is told it lost rows, which it may have.
+    const auto half = dropped_.begin() + kMaxDropRanges / 2;
+    forgottenDrops_ = std::prev(half)->second;
+    dropped_.erase(dropped_.begin(), half);
+  }
+}
+
+bool LocalStore::droppedAfter(std::uint64_t since, std::uint64_t upTo) const {
+  if (forgottenDrops_ > since) return true;
+  return std::ranges::any_of(dropped_, [&](const auto& r) { return r.second > since && r.first <= upTo; });
+}
+
+void LocalStore::finishBatch(std::vector<Row>& batch, bool dropAll) {
+  std::uint64_t bytes = 0;
+  for (const Row& row : batch) {
+    bytes += row.size;
+    if (row.bad) ++droppedBadRows_;
+    if (row.bad || dropAll) noteDropped(row.number, row.number);
+  }
+  processedRows_ = batch.back().number;
+  pendingRows_ -= batch.size();
+  pendingBytes_ -= bytes;
+  batch.clear();
+  if (overflowing_ && pendingRows_ <= options_.maxPendingRows / 2 && pendingBytes_ <= options_.maxPendingBytes / 2)
+    overflowing_ = false;
+  processed_.notify_all();
+}
+
 void LocalStore::writerLoop() {
+  // Rows taken from the queue and not yet committed; after a failure the next
+  // attempt adds whatever arrived meanwhile, keeping the order.
   std::vector<Row> batch;
+  std::string badError;        // why the first of the batch's bad rows was refused
+  std::uint64_t failures = 0;  // consecutive failed attempts
+  std::chrono::milliseconds delay{0};
   std::unique_lock lock(mutex_);
   for (;;) {
-    wake_.wait(lock, [&] { return stopping_ || !queue_.empty(); });
-    if (queue_.empty()) break;  // stopping, all written
-    // Gather more rows until the interval is up, unless someone is waiting for them.
-    wake_.wait_until(lock, firstPending_ + options_.commitInterval, [&] {
-      return stopping_ || flushTarget_ > processedRows_ || queueBytes_ >= options_.maxPendingBytes / 2;
-    });
-    batch.swap(queue_);
-    queueBytes_ = 0;
-    const std::uint64_t end = enqueued_;
+    if (failures == 0) {
+      wake_.wait(lock, [&] { return stopping_ || !queue_.empty(); });
+    } else {
+      // Only close() cuts the pause short, for one attempt at once.
+      const bool wasStopping = stopping_;
+      wake_.wait_for(lock, delay, [&] { return stopping_ != wasStopping; });
+    }
+    if (batch.empty()) {
+      batch.swap(queue_);
+    } else {
+      std::move(queue_.begin(), queue_.end(), std::back_inserter(batch));
+      queue_.clear();
+    }
+    if (batch.empty()) break;  // stopping, all written
+    const bool giveUp = stopping_ && std::chrono::steady_clock::now() >= giveUpAt_;
     lock.unlock();
 
-    bool ok = writeBatch(batch);
-    if (!ok) {
-      logError("LocalStore::writerLoop", "write failed, retrying");
-      std::this_thread::sleep_for(options_.retryDelay);
-      ok = writeBatch(batch);
-      if (!ok) {
+    std::string error;
+    const bool ok = writeBatch(batch, &error, &badError);
+    if (ok) {
+      if (const auto bad = std::ranges::count(batch, true, &Row::bad); bad > 0) {
         VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::writerLoop",
-               "%s: write failed again, dropping %zu rows (%s)", path_.c_str(), batch.size(), sqlite3_errmsg(db_));
+               "%s: dropping %zu of %zu rows, refused by the database (%s)", path_.c_str(),
+               static_cast<std::size_t>(bad), batch.size(), badError.c_str());
       }
+      if (failures > 0) {
+        VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Default, "LocalStore::writerLoop",
+               "%s: written after %llu failed attempts", path_.c_str(), static_cast<unsigned long long>(failures));
+      }
+      failures = 0;
+    } else if (giveUp) {
+      VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::writerLoop",
+             "%s: write failed again, dropping %zu rows (%s)", path_.c_str(), batch.size(), error.c_str());
+      failures = 0;
+    } else {
+      if (failures == 0) {
+        VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::writerLoop",
+               "%s: write failed, retrying until it succeeds (%s)", path_.c_str(), error.c_str());
+      }
+      ++failures;
+      delay = failures == 1 ? options_.retryDelay : std::min(delay * 2, options_.maxRetryDelay);
     }
-    batch.clear();
 
     lock.lock();
-    processedRows_ = end;
-    lastWriteOk_ = ok;
-    overflowLogged_ = false;
-    processed_.notify_all();
-  }
-}
-
-bool LocalStore::writeBatch(const std::vector<Row>& batch) {
-  if (!exec("BEGIN IMMEDIATE")) return false;
-  for (const auto& row : batch) {
-    if (!writeRow(row)) {
-      exec("ROLLBACK");
-      return false;
+    if (!ok) {
+      ++writeErrors_;
+      lastError_ = error;
+    }
+    if (ok || giveUp) {
+      if (!badError.empty()) lastError_ = badError;
+      badError.clear();
+      finishBatch(batch, !ok);
     }
   }
-  if (!exec("COMMIT")) {
-    exec("ROLLBACK");
-    return false;
-  }
-  return true;
 }
 
-bool LocalStore::writeRow(const Row& row) {
+bool LocalStore::writeBatch(std::vector<Row>& batch, std::string* error, std::string* badError) {
+  auto fail = [&] {
+    *error = sqlite3_errmsg(db_);
+    if (!sqlite3_get_autocommit(db_)) exec("ROLLBACK");
+    return false;
+  };
+  for (;;) {
+    if (!exec("BEGIN IMMEDIATE")) return fail();
+    bool restart = false;
+    for (Row& row : batch) {
+      if (row.bad) continue;
+      const int rc = writeRow(row, error);
+      if (rc == SQLITE_DONE) continue;
+      if (!aboutTheRow(rc)) {
+        if (!sqlite3_get_autocommit(db_)) exec("ROLLBACK");
+        return false;
+      }
+      row.bad = true;
+      if (badError->empty()) *badError = *error;
+      // Such an error normally undoes only its own statement; should it have
+      // ended the transaction, start over without the row.
+      if (sqlite3_get_autocommit(db_)) {
+        restart = true;
+        break;
+      }
+    }
+    if (restart) continue;
+    if (exec("COMMIT")) return true;
+    return fail();
+  }
+}
+
+int LocalStore::writeRow(const Row& row, std::string* error) {
   sqlite3_stmt* s = nullptr;
+  int rc = SQLITE_OK;
+  // The first failed bind stands for the row: its text may be over the length limit.
+  auto bound = [&rc](int r) {
+    if (rc == SQLITE_OK) rc = r;
+  };
   switch (row.kind) {
     case Row::Kind::Session:
       s = statements_[kInsertSession];
-      sqlite3_bind_int64(s, 1, row.id);
-      bindText(s, 2, row.t1);
-      bindText(s, 3, row.t2);
-      sqlite3_bind_double(s, 4, row.at);
+      bound(sqlite3_bind_int64(s, 1, row.id));
+      bound(bindText(s, 2, row.t1));
+      bound(bindText(s, 3, row.t2));
+      bound(sqlite3_bind_double(s, 4, row.at));
       break;
     case Row::Kind::Backends:
       s = statements_[kSetBackends];
-      sqlite3_bind_int64(s, 1, row.id);
-      if (row.hasId) {
-        bindText(s, 2, row.t1);
-      } else {
-        sqlite3_bind_null(s, 2);
-      }
+      bound(sqlite3_bind_int64(s, 1, row.id));
+      bound(row.hasId ? bindText(s, 2, row.t1) : sqlite3_bind_null(s, 2));
       break;
     case Row::Kind::Flushed:
       s = statements_[kSetFlushed];
-      sqlite3_bind_int64(s, 1, row.id);
-      sqlite3_bind_double(s, 2, row.at);
+      bound(sqlite3_bind_int64(s, 1, row.id));
+      bound(sqlite3_bind_double(s, 2, row.at));
       break;
     case Row::Kind::Message:
       s = statements_[kInsertMessage];
       // A session's message; otherwise a one-shot one, which alone carries the info.
       if (row.hasId) {
-        sqlite3_bind_int64(s, 1, row.id);
-        sqlite3_bind_null(s, 2);
-        sqlite3_bind_null(s, 3);
+        bound(sqlite3_bind_int64(s, 1, row.id));
+        bound(sqlite3_bind_null(s, 2));
+        bound(sqlite3_bind_null(s, 3));
       } else {
-        sqlite3_bind_null(s, 1);
-        bindText(s, 2, row.t1);
-        bindText(s, 3, row.t2);
+        bound(sqlite3_bind_null(s, 1));
+        bound(bindText(s, 2, row.t1));
+        bound(bindText(s, 3, row.t2));
       }
-      sqlite3_bind_int64(s, 4, row.a);
-      sqlite3_bind_int64(s, 5, row.b);
-      bindText(s, 6, row.t3);
-      sqlite3_bind_double(s, 7, row.at);
+      bound(sqlite3_bind_int64(s, 4, row.a));
+      bound(sqlite3_bind_int64(s, 5, row.b));
+      bound(bindText(s, 6, row.t3));
+      bound(sqlite3_bind_double(s, 7, row.at));
       break;
     case Row::Kind::Analytics:
       s = statements_[kInsertAnalytics];
-      bindText(s, 1, row.t1);
-      bindText(s, 2, row.t2);
-      sqlite3_bind_double(s, 3, row.at);
+      bound(bindText(s, 1, row.t1));
+      bound(bindText(s, 2, row.t2));
+      bound(sqlite3_bind_double(s, 3, row.at));
       break;
     case Row::Kind::Energy:
       s = statements_[kInsertEnergy];
-      sqlite3_bind_int64(s, 1, row.a);
-      bindText(s, 2, row.t1);
-      bindText(s, 3, row.t2);
-      sqlite3_bind_double(s, 4, row.at);
+      bound(sqlite3_bind_int64(s, 1, row.a));
+      bound(bindText(s, 2, row.t1));
+      bound(bindText(s, 3, row.t2));
+      bound(sqlite3_bind_double(s, 4, row.at));
       break;
   }
-  const int rc = sqlite3_step(s);
+  if (rc == SQLITE_OK) rc = sqlite3_step(s);
+  if (rc != SQLITE_DONE) *error = sqlite3_errmsg(db_);
   sqlite3_reset(s);
-  return rc == SQLITE_DONE;
+  return rc;
 }
 
 }  // namespace vireo::linux_platform

@@ -1,9 +1,11 @@
 // The local SQLite store behind the telemetry, analytics and energy-log services.
 //
 // Producers hand rows over to a bounded in-memory queue and never touch the disk;
-// one writer thread takes everything queued and commits it in one transaction
-// (group commit), at least every commit interval while rows are pending, or at
-// once when a flush asks for it.
+// one writer thread takes everything queued and commits it in one transaction as
+// soon as it is idle, so rows that arrive during a commit go into the next one
+// (group commit). A write the database refuses (locked, full, I/O) is retried with
+// a growing pause and nothing is dropped while the process lives; a row the
+// database refuses on its own (a constraint, too big) is dropped alone.
 #pragma once
 
 #include <sqlite3.h>
@@ -18,6 +20,7 @@
 #include <string>
 #include <string_view>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "base/value.h"
@@ -27,17 +30,32 @@
 
 namespace vireo::linux_platform {
 
+// What a live status view shows of the store, read in one piece.
+struct StoreStatus {
+  std::uint64_t pendingRows = 0;    // handed over, not yet committed
+  std::uint64_t pendingBytes = 0;
+  std::uint64_t refusedRows = 0;    // refused at insert: queue full, or closed/unusable store
+  std::uint64_t droppedBadRows = 0; // rows the database refused on their own
+  std::uint64_t writeErrors = 0;    // failed write attempts (each retried)
+  std::string lastError;            // of the last failed attempt or dropped row, "" if none
+  bool usable = false;
+};
+
 class LocalStore {
  public:
   struct Options {
-    // Memory the pending rows may take before producers are refused.
+    // Memory and rows the pending (not yet committed) rows may take before
+    // producers are refused.
     std::size_t maxPendingBytes = 64u << 20;
-    // Longest time a handed-over row waits for its commit.
-    std::chrono::milliseconds commitInterval{100};
-    // Pause before the one retry of a failed batch.
+    std::size_t maxPendingRows = 100000;
+    // Pause after a failed write, doubled after each further failure up to the maximum.
     std::chrono::milliseconds retryDelay{50};
+    std::chrono::milliseconds maxRetryDelay{2000};
     // How long a write waits for another process's lock on the file.
     std::chrono::milliseconds busyTimeout{5000};
+    // How long close() keeps retrying a failing write before it drops the rows
+    // (a write already waiting on a lock may add up to busyTimeout).
+    std::chrono::milliseconds closeTimeout{5000};
   };
 
   // Opens (creating it and its directory) STATE/vireo.db. A store that cannot be
@@ -45,7 +63,11 @@ class LocalStore {
   LocalStore(const std::string& stateDirectory, Logger& logger, Clock& clock, Options options);
   LocalStore(const std::string& stateDirectory, Logger& logger, Clock& clock)
       : LocalStore(stateDirectory, logger, clock, Options{}) {}
-  static std::shared_ptr<LocalStore> open(const ServiceDirectories& directories, Logger& logger, Clock& clock);
+  static std::shared_ptr<LocalStore> open(const ServiceDirectories& directories, Logger& logger, Clock& clock,
+                                          Options options);
+  static std::shared_ptr<LocalStore> open(const ServiceDirectories& directories, Logger& logger, Clock& clock) {
+    return open(directories, logger, clock, Options{});
+  }
   ~LocalStore();
 
   LocalStore(const LocalStore&) = delete;
@@ -59,7 +81,8 @@ class LocalStore {
   double now() const { return unixSeconds(clock_.now()); }
 
   // Each insert returns false (or nothing) when the store is unusable, closed or
-  // its queue is full; the row is then not recorded.
+  // its queue is full; the row is then not recorded. A row accepted is committed
+  // unless the database refuses that row itself or close() gives up on a failing disk.
   std::optional<std::int64_t> insertTelemetrySession(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                                      double createdAt);
   // backends absent stores NULL.
@@ -72,11 +95,17 @@ class LocalStore {
   bool insertAnalyticsEvent(std::string_view name, const Dictionary& payload, double at);
   bool insertEnergyEvent(std::int64_t client, std::string_view name, const Dictionary& payload, double at);
 
-  // Waits until everything handed over so far is committed (or dropped after a
-  // failed retry). True when it all got there and the last write succeeded.
-  bool flush(std::chrono::milliseconds timeout);
-  // Commits everything and stops the writer; later inserts are refused. Idempotent.
+  // Rows handed over so far: a mark for flush(timeout, since).
+  std::uint64_t handedOver() const;
+  // Waits until every row handed over before the call is committed or dropped.
+  // True only when they all got there; rows handed over before the mark since are
+  // not looked at (a caller passes the mark taken at its previous flush).
+  bool flush(std::chrono::milliseconds timeout, std::uint64_t since = 0);
+  // Commits everything and stops the writer; later inserts are refused. Retries a
+  // failing write for Options::closeTimeout, then drops what is left. Idempotent.
   void close();
+
+  StoreStatus status() const;
 
   static std::string jsonObject(const Dictionary& d);
 
@@ -86,9 +115,13 @@ class LocalStore {
   bool openDatabase(const std::string& stateDirectory);
   bool prepareStatements();
   bool enqueue(Row&& row);
+  bool refuse();
   void writerLoop();
-  bool writeBatch(const std::vector<Row>& batch);
-  bool writeRow(const Row& row);
+  bool writeBatch(std::vector<Row>& batch, std::string* error, std::string* badError);
+  int writeRow(const Row& row, std::string* error);
+  void finishBatch(std::vector<Row>& batch, bool dropAll);
+  void noteDropped(std::uint64_t first, std::uint64_t last);
+  bool droppedAfter(std::uint64_t since, std::uint64_t upTo) const;
   bool exec(const char* sql);
   void logError(const char* function, const char* what);
   void finalizeDatabase();
@@ -105,19 +138,26 @@ class LocalStore {
   sqlite3_stmt* statements_[6] = {};
 
   // mutex_ guards the queue and everything below it down to the writer thread.
-  std::mutex mutex_;
-  std::condition_variable wake_;      // the writer: rows, flush requests, stop
+  // Rows are numbered from 1 in the order they are handed over and processed
+  // (committed or dropped) in that order.
+  mutable std::mutex mutex_;
+  std::condition_variable wake_;      // the writer: rows, stop
   std::condition_variable processed_; // flush() waiters
-  std::vector<Row> queue_;
-  std::size_t queueBytes_ = 0;
-  std::chrono::steady_clock::time_point firstPending_{};
-  std::uint64_t enqueued_ = 0;   // rows handed over, ever
-  std::uint64_t processedRows_ = 0; // rows committed or dropped
-  std::uint64_t flushTarget_ = 0;
-  bool lastWriteOk_ = true;
-  bool overflowLogged_ = false;
+  std::vector<Row> queue_;            // not yet taken by the writer
+  std::uint64_t pendingRows_ = 0;     // queue_ and the writer's batch
+  std::uint64_t pendingBytes_ = 0;
+  std::uint64_t enqueued_ = 0;        // rows handed over, ever
+  std::uint64_t processedRows_ = 0;   // rows committed or dropped, ever
+  std::vector<std::pair<std::uint64_t, std::uint64_t>> dropped_;  // recent ranges of dropped row numbers
+  std::uint64_t forgottenDrops_ = 0;  // the last row number of ranges no longer in dropped_
+  std::uint64_t refusedRows_ = 0;
+  std::uint64_t droppedBadRows_ = 0;
+  std::uint64_t writeErrors_ = 0;
+  std::string lastError_;
+  bool overflowing_ = false;  // refusing since the queue last went below half its limits
   bool stopping_ = false;
   bool closed_ = false;
+  std::chrono::steady_clock::time_point giveUpAt_{};  // set by close()
   std::thread writer_;
 };
 

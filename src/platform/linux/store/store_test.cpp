@@ -95,27 +95,51 @@ TEST_F(StoreTest, CreatesThePublishedSchemaInWalModeAndRowsShowWithinASecond) {
 }
 
 // Another process holding the write lock stands in for a failing disk.
-TEST_F(StoreTest, FailedBatchIsDroppedAfterRetryAndWritingGoesOn) {
-  LocalStore store(state(), logger, clock, {.maxPendingBytes = 64 << 10, .retryDelay = 10ms, .busyTimeout = 20ms});
+TEST_F(StoreTest, LockedStoreKeepsEveryRowUntilItCanWriteAndRefusesPastItsLimit) {
+  constexpr int kLimit = 40;
+  LocalStore store(state(), logger, clock,
+                   {.maxPendingBytes = 64 << 10, .maxPendingRows = kLimit, .retryDelay = 5ms,
+                    .maxRetryDelay = 20ms, .busyTimeout = 10ms, .closeTimeout = 50ms});
   Reader blocker(db());
   ASSERT_TRUE(blocker.exec("BEGIN IMMEDIATE"));
-  ASSERT_TRUE(store.insertAnalyticsEvent("lost", Dictionary{}, 1.0));
-  EXPECT_FALSE(store.flush(5s));
-  EXPECT_GE(errors(), 2u);
+  for (int i = 0; i < kLimit; ++i) ASSERT_TRUE(store.insertAnalyticsEvent("held", Dictionary{{"i", i}}, 1.0)) << i;
+  // Past the row limit, and a row over the byte limit alone, are refused and counted.
+  EXPECT_FALSE(store.insertAnalyticsEvent("over", Dictionary{}, 1.0));
+  EXPECT_FALSE(store.insertAnalyticsEvent("over", Dictionary{}, 1.0));
+  EXPECT_FALSE(store.insertAnalyticsEvent("big", Dictionary{{"pad", std::string(64 << 10, 'x')}}, 1.0));
+  EXPECT_EQ(logger.count("writer queue full"), 1u);
 
-  // While the writer is stuck, the bounded queue refuses rows instead of growing.
-  ASSERT_TRUE(store.insertAnalyticsEvent("stuck", Dictionary{}, 1.0));
-  int accepted = 0;
-  while (store.insertAnalyticsEvent("fill", Dictionary{{"pad", std::string(512, 'x')}}, 1.0) && accepted < 10000)
-    ++accepted;
-  EXPECT_LT(accepted, 10000);
+  // Several failed attempts later, nothing is lost and the flush says it is not there.
+  for (auto until = std::chrono::steady_clock::now() + 10s;
+       store.status().writeErrors < 3 && std::chrono::steady_clock::now() < until;)
+    std::this_thread::sleep_for(5ms);
+  EXPECT_FALSE(store.flush(50ms));
+  StoreStatus blocked = store.status();
+  EXPECT_GE(blocked.writeErrors, 3u);
+  EXPECT_EQ(blocked.pendingRows, std::uint64_t{kLimit});
+  EXPECT_GT(blocked.pendingBytes, 0u);
+  EXPECT_EQ(blocked.refusedRows, 3u);
+  EXPECT_EQ(blocked.lastError, "database is locked");
+  EXPECT_TRUE(blocked.usable);
+  EXPECT_EQ(logger.count("write failed, retrying"), 1u);
 
   ASSERT_TRUE(blocker.exec("COMMIT"));
-  store.flush(5s);  // may still meet the batch that ran into the lock
-  ASSERT_TRUE(store.insertAnalyticsEvent("kept", Dictionary{}, 2.0));
   EXPECT_TRUE(store.flush(5s));
-  EXPECT_EQ(blocker.scalar("SELECT COUNT(*) FROM analytics_events WHERE name='lost'"), "0");
-  EXPECT_EQ(blocker.scalar("SELECT COUNT(*) FROM analytics_events WHERE name='kept'"), "1");
+  EXPECT_EQ(blocker.scalar("SELECT COUNT(DISTINCT json_extract(payload, '$.i')) FROM analytics_events "
+                           "WHERE name = 'held'"),
+            std::to_string(kLimit));
+  EXPECT_EQ(store.status().pendingRows, 0u);
+  EXPECT_TRUE(store.insertAnalyticsEvent("after", Dictionary{}, 2.0));
+  EXPECT_TRUE(store.flush(5s));
+
+  // Closing cannot wait for ever: it gives up on a store that stays locked.
+  ASSERT_TRUE(blocker.exec("BEGIN IMMEDIATE"));
+  ASSERT_TRUE(store.insertAnalyticsEvent("lost", Dictionary{}, 3.0));
+  store.close();
+  EXPECT_EQ(logger.count("write failed again, dropping 1 rows"), 1u);
+  EXPECT_FALSE(store.insertAnalyticsEvent("closed", Dictionary{}, 3.0));
+  ASSERT_TRUE(blocker.exec("COMMIT"));
+  EXPECT_EQ(blocker.scalar("SELECT group_concat(DISTINCT name) FROM analytics_events"), "held,after");
 }
 
 TEST_F(StoreTest, FlushedRowsSurviveSigkillAndIdsContinue) {
@@ -197,6 +221,45 @@ TEST_F(ServicesTest, SessionRowAndMessagesAreVisibleOnceTheFlushAnswers) {
   EXPECT_EQ(reader.scalar("SELECT group_concat(session || ':' || category || ':' || type || ':' || payload, ' ') "
                           "FROM telemetry_messages WHERE session_info IS NULL AND user_info IS NULL"),
             id + ":8:4:{\"a_b\":1} " + id + ":3:1:{\"n\":\"v\"}");
+}
+
+// Another writer took the session id this store hands out next: that row alone is
+// refused, and only the flushes that cover it say so.
+TEST_F(ServicesTest, RowTheDatabaseRefusesIsDroppedAloneAndFailsOnlyFlushesThatCoverIt) {
+  store.reset();
+  store = std::make_shared<LocalStore>(state(), logger, clock, LocalStore::Options{.busyTimeout = 1ms});
+  LocalTelemetryService service(store, root);
+  Reader other(db());
+  ASSERT_TRUE(other.exec("BEGIN IMMEDIATE"));
+  ASSERT_TRUE(other.exec("INSERT INTO telemetry_sessions (id, session_info, user_info, created_at) "
+                         "VALUES (1, '{}', '{}', 0)"));
+  ASSERT_TRUE(store->insertAnalyticsEvent("before", Dictionary{}, 1.0));
+  auto clash = service.createSession(Dictionary{{"mine", 1}}, Dictionary{}, {});
+  ASSERT_EQ(dynamic_cast<LocalTelemetrySession&>(*clash).rowId(), std::optional<std::int64_t>(1));
+  ASSERT_TRUE(store->insertAnalyticsEvent("after", Dictionary{}, 1.0));
+  // Two more failed attempts: the last of them held all three rows, and so will the next.
+  const auto failed = store->status().writeErrors;
+  while (store->status().writeErrors < failed + 2) std::this_thread::sleep_for(1ms);
+  ASSERT_TRUE(other.exec("COMMIT"));
+
+  EXPECT_FALSE(store->flush(5s));  // every row so far: the refused one among them
+  EXPECT_TRUE(flush(*clash).has_value());
+  EXPECT_EQ(other.scalar("SELECT group_concat(name) FROM analytics_events"), "before,after");
+  EXPECT_EQ(other.scalar("SELECT COUNT(*) || session_info FROM telemetry_sessions"), "1{}");
+  const StoreStatus status = store->status();
+  EXPECT_EQ(status.droppedBadRows, 1u);
+  EXPECT_EQ(status.lastError, "UNIQUE constraint failed: telemetry_sessions.id");
+  EXPECT_EQ(logger.count("dropping 1 of 3 rows"), 1u);
+
+  // A later session, and the same session's next flush, are not blamed for it.
+  auto next = service.createSession(Dictionary{}, Dictionary{}, {});
+  std::optional<Error> error;
+  EXPECT_TRUE(next->sendMessage(1, 2, Dictionary{}, &error));
+  EXPECT_EQ(flush(*next), std::nullopt);
+  EXPECT_EQ(flush(*clash), std::nullopt);
+  const std::uint64_t mark = store->handedOver();
+  ASSERT_TRUE(store->insertAnalyticsEvent("later", Dictionary{}, 2.0));
+  EXPECT_TRUE(store->flush(5s, mark));
 }
 
 TEST_F(ServicesTest, BackendDiscoveryFollowsTelemetryConf) {

@@ -69,6 +69,7 @@ std::shared_ptr<TelemetrySession> LocalTelemetryService::createSession(const Dic
                                                                        const Dictionary& userInfo,
                                                                        const std::vector<std::string>&) {
   LocalStore& store = *core_->store;
+  const std::uint64_t mark = store.handedOver();
   auto rowId = store.insertTelemetrySession(sessionInfo, userInfo, store.now());
   if (!rowId) {
     VR_LOG(store.logger(), LogScope::DefaultLog, LogLevel::Error, "LocalTelemetryService::createSession",
@@ -76,7 +77,7 @@ std::shared_ptr<TelemetrySession> LocalTelemetryService::createSession(const Dic
   }
   std::string token;
   if (const Value* v = sessionInfo.find(telemetry_keys::kHierarchyToken)) token = v->text();
-  return std::make_shared<LocalTelemetrySession>(core_, rowId, std::move(token));
+  return std::make_shared<LocalTelemetrySession>(core_, rowId, std::move(token), mark);
 }
 
 bool LocalTelemetryService::sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
@@ -99,8 +100,9 @@ std::optional<std::vector<std::string>> LocalTelemetryService::readBackends(cons
 }
 
 LocalTelemetrySession::LocalTelemetrySession(std::shared_ptr<LocalTelemetryCore> core,
-                                             std::optional<std::int64_t> rowId, std::string token)
-    : core_(std::move(core)), rowId_(rowId), token_(std::move(token)) {}
+                                             std::optional<std::int64_t> rowId, std::string token,
+                                             std::uint64_t mark)
+    : core_(std::move(core)), rowId_(rowId), token_(std::move(token)), flushMark_(mark) {}
 
 void LocalTelemetrySession::startConfiguration(
     std::function<void(std::optional<std::vector<std::string>> backends)> completion) {
@@ -126,11 +128,12 @@ bool LocalTelemetrySession::sendMessage(std::uint16_t category, std::uint16_t ty
 
 void LocalTelemetrySession::flushMessages(std::function<void(std::optional<Error>)> completion) {
   LocalStore& store = *core_->store;
+  const std::uint64_t since = flushMark_.exchange(store.handedOver());
   if (rowId_) store.setFlushed(*rowId_, store.now());
-  // The writer commits at once when asked; waiting here only holds up later
+  // The writer commits as soon as it is idle; waiting here only holds up later
   // completions by one commit.
-  core_->thread.post([store = core_->store, completion = std::move(completion)] {
-    const bool ok = store->flush(kFlushTimeout);
+  core_->thread.post([store = core_->store, since, completion = std::move(completion)] {
+    const bool ok = store->flush(kFlushTimeout, since);
     if (!completion) return;
     if (ok) {
       completion(std::nullopt);

@@ -2,6 +2,7 @@
 // telemetry_sessions row, each message a telemetry_messages row.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -37,9 +38,10 @@ class LocalTelemetryService : public TelemetryService {
 
 class LocalTelemetrySession : public TelemetrySession {
  public:
-  // rowId is absent when the session's row could not be handed to the store.
+  // rowId is absent when the session's row could not be handed to the store;
+  // mark is the store's handedOver() from before that row.
   LocalTelemetrySession(std::shared_ptr<LocalTelemetryCore> core, std::optional<std::int64_t> rowId,
-                        std::string token);
+                        std::string token, std::uint64_t mark = 0);
 
   void startConfiguration(std::function<void(std::optional<std::vector<std::string>> backends)> completion) override;
   bool sendMessage(std::uint16_t category, std::uint16_t type, const Dictionary& payload,
@@ -53,6 +55,9 @@ class LocalTelemetrySession : public TelemetrySession {
   const std::shared_ptr<LocalTelemetryCore> core_;
   const std::optional<std::int64_t> rowId_;
   const std::string token_;
+  // A flush answers for the rows handed over since the previous one (other
+  // sessions' rows among them): a row dropped long ago fails no later flush.
+  std::atomic<std::uint64_t> flushMark_;
 };
 
 }  // namespace vireo::linux_platform
