@@ -163,7 +163,12 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) { object.startReportingSessionForID(id, answerBool(p)); });
+      self(userdata).submit(m, [id](auto& object, auto& p) {
+        object.startReportingSessionForID(id, StartReply(answerBool(p), [p] {
+                                            p->answer(Reply::error(bus::kSessionEndedError,
+                                                                   "the session ended without a stop"));
+                                          }));
+      });
       return 1;
     });
   }

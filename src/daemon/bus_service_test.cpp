@@ -45,9 +45,9 @@ class Fake : public VRReportingServiceProtocol, public ListenerDelegate, public 
     record(calls, "create " + std::to_string(id));
     reply(true);
   }
-  void startReportingSessionForID(std::int64_t, BoolReply reply) override {
+  void startReportingSessionForID(std::int64_t, StartReply reply) override {
     std::lock_guard lock(mutex);
-    kept.push_back(reply);
+    kept.push_back(reply.answer);
   }
   void getServiceNameForReporterID(std::int64_t, ServiceTypeReply) override {}
   void getAllReporters(ReporterListReply) override {}

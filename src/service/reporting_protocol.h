@@ -18,6 +18,18 @@ using ErrorReply = std::function<void(std::optional<Error>)>;
 using DictionaryReply = std::function<void(Dictionary)>;
 using ReporterListReply = std::function<void(std::vector<std::int64_t>)>;
 
+// The answer to a start. A started session holds it and answers true when it
+// stops; a session that goes away holding it unanswered (replaced by a new create)
+// calls sessionEnded instead, so that no caller waits for ever.
+struct StartReply {
+  StartReply() = default;
+  StartReply(std::nullptr_t) {}
+  StartReply(BoolReply answer, std::function<void()> sessionEnded = nullptr)
+      : answer(std::move(answer)), sessionEnded(std::move(sessionEnded)) {}
+  BoolReply answer;
+  std::function<void()> sessionEnded;
+};
+
 class VRReportingServiceProtocol {
  public:
   virtual ~VRReportingServiceProtocol() = default;
@@ -30,7 +42,7 @@ class VRReportingServiceProtocol {
   // setConfiguration:forReporterID:reply:
   virtual void setConfiguration(Dictionary configuration, std::int64_t reporterID, BoolReply reply) = 0;
   // startReportingSessionForID:reply:
-  virtual void startReportingSessionForID(std::int64_t reporterID, BoolReply reply) = 0;
+  virtual void startReportingSessionForID(std::int64_t reporterID, StartReply reply) = 0;
   // sendMessage:withCategory:andType:forReportingIDs:reply: (no list: broadcast)
   virtual void sendMessage(Dictionary payload, std::uint32_t category, std::uint16_t type,
                            std::optional<std::vector<std::int64_t>> reporterIDs, ErrorReply reply) = 0;

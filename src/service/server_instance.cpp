@@ -1,5 +1,7 @@
 #include "service/server_instance.h"
 
+#include <atomic>
+#include <memory>
 #include <utility>
 
 #include "platform/logger.h"
@@ -78,6 +80,25 @@ std::shared_ptr<VRReportingSession> VRReportingServerInstance::findReportingSess
 
 // ---- operations ----
 
+namespace {
+// The start answer a session keeps: answered once, by the stop (or a restart);
+// when the last copy goes unanswered, the session went away without a stop.
+BoolReply holdUntilStopped(StartReply reply) {
+  struct Held {
+    explicit Held(StartReply r) : reply(std::move(r)) {}
+    ~Held() {
+      if (!answered.load() && reply.sessionEnded) reply.sessionEnded();
+    }
+    StartReply reply;
+    std::atomic<bool> answered{false};
+  };
+  auto held = std::make_shared<Held>(std::move(reply));
+  return [held](bool ok) {
+    if (!held->answered.exchange(true) && held->reply.answer) held->reply.answer(ok);
+  };
+}
+}  // namespace
+
 void VRReportingServerInstance::createReportingSession(std::int64_t reporterID, BoolReply reply) {
   constexpr const char* kLabel = "-[VRReportingServerInstance createReportingSession:reply:]";
   VR_DEBUG(env_->logger(), LogScope::Server, kLabel, "creating session for reporter %lli", (long long)reporterID);
@@ -141,7 +162,7 @@ void VRReportingServerInstance::setConfiguration(Dictionary configuration, std::
       });
 }
 
-void VRReportingServerInstance::startReportingSessionForID(std::int64_t reporterID, BoolReply reply) {
+void VRReportingServerInstance::startReportingSessionForID(std::int64_t reporterID, StartReply reply) {
   VR_DEBUG(env_->logger(), LogScope::Server, "-[VRReportingServerInstance startReportingSessionForID:reply:]",
            "starting session for reporter %lli", (long long)reporterID);
   serverQueue_->async([self = shared_from_this(), reporterID, reply = std::move(reply)]() mutable {
@@ -149,10 +170,10 @@ void VRReportingServerInstance::startReportingSessionForID(std::int64_t reporter
   });
 }
 
-void VRReportingServerInstance::doStart(std::int64_t reporterID, BoolReply reply) {
+void VRReportingServerInstance::doStart(std::int64_t reporterID, StartReply reply) {
   env_->platform.tracer.emit(trace::kServerStart);
   if (reporterID == 0) {
-    if (reply) reply(true);
+    if (reply.answer) reply.answer(true);
     return;
   }
   auto session = findReportingSessionForID(reporterID, true);
@@ -164,7 +185,7 @@ void VRReportingServerInstance::doStart(std::int64_t reporterID, BoolReply reply
   // A session started again answers the previous start now.
   if (auto previous = session->transactionCompleteBlock()) previous(true);
   // The start is answered when the session stops.
-  session->setTransactionCompleteBlock(std::move(reply));
+  session->setTransactionCompleteBlock(holdUntilStopped(std::move(reply)));
 }
 
 void VRReportingServerInstance::stopReportingSessionForID(std::int64_t reporterID, BoolReply reply) {

@@ -39,7 +39,7 @@ class VRReportingServerInstance final : public VRReportingServiceProtocol,
   void setServiceType(std::uint16_t serviceType, std::int64_t reporterID, BoolReply reply) override;
   void getServiceNameForReporterID(std::int64_t reporterID, ServiceTypeReply reply) override;
   void setConfiguration(Dictionary configuration, std::int64_t reporterID, BoolReply reply) override;
-  void startReportingSessionForID(std::int64_t reporterID, BoolReply reply) override;
+  void startReportingSessionForID(std::int64_t reporterID, StartReply reply) override;
   void sendMessage(Dictionary payload, std::uint32_t category, std::uint16_t type,
                    std::optional<std::vector<std::int64_t>> reporterIDs, ErrorReply reply) override;
   void stopReportingSessionForID(std::int64_t reporterID, BoolReply reply) override;
@@ -68,7 +68,7 @@ class VRReportingServerInstance final : public VRReportingServiceProtocol,
                             std::int32_t pid, std::weak_ptr<VRReportingServiceDelegateProtocol> delegate);
 
   // Queued halves of the operations; they run on the server queue only.
-  void doStart(std::int64_t reporterID, BoolReply reply);
+  void doStart(std::int64_t reporterID, StartReply reply);
   void doStop(std::int64_t reporterID, BoolReply reply);
   void doDestroy(std::int64_t reporterID, BoolReply reply);
   void doSendMessage(const Dictionary& payload, std::uint32_t category, std::uint16_t type,

@@ -115,12 +115,17 @@ TEST_F(ServiceTest, LookupFollowsRegistryOrderAndOnlyTheOwnerStopsOrDestroys) {
   create(*second, 9, 2);
   create(*first, 9);
   create(*first, 3);
-  start(*first, 9);
+  int ended = 0;
+  first->client().startReportingSessionForID(9, StartReply(starts.callback(), [&] { ++ended; }));
+  h.pump();
   auto replaced = sessionOf(*first, 9);
   create(*first, 9, 1);
   EXPECT_TRUE(replaced->started());
   EXPECT_NE(sessionOf(*first, 9), replaced);
   EXPECT_FALSE(sessionOf(*first, 9)->started());
+  replaced.reset();  // went away holding its start: the caller is told
+  EXPECT_EQ(ended, 1);
+  EXPECT_TRUE(starts.values.empty());
   Replies<Dictionary> valid;
   asker->client().reporterIDValid(9, valid.callback());
   Replies<std::vector<std::int64_t>> reporters;

@@ -80,6 +80,15 @@ TEST_F(ProtocolTest, ReplyTableIncludingIDZeroAndHeldStarts) {
   EXPECT_FALSE(contains(*c->getAllReporters(), 42));
   EXPECT_EQ(*c->getServiceNameForReporterID(42), 65535);
 
+  // A held start whose session is replaced by a new create is told so.
+  ASSERT_EQ(*c->createReportingSession(11), true);
+  auto replacedStart = c->startReportingSessionForID(11);
+  ASSERT_EQ(*c->createReportingSession(11), true);
+  answer = replacedStart.waitFor(5s);
+  ASSERT_TRUE(answer);
+  ASSERT_FALSE(answer->ok());
+  EXPECT_EQ(answer->error().name, "com.orvane.vireo.Error.SessionEnded");
+
   // A start still waiting when its client goes away ends with an error, not a hang.
   ASSERT_EQ(*c->createReportingSession(9), true);
   auto orphan = c->startReportingSessionForID(9);

@@ -13,5 +13,9 @@ inline constexpr const char* kNotifyPath = "/com/orvane/Notify1";
 inline constexpr const char* kNotifyInterface = "com.orvane.Notify1";
 inline constexpr const char* kReportingNotification = "com.orvane.vireo.reporting";
 inline constexpr const char* kReportingDisabledError = "com.orvane.audio.reporting.ReportingDisabled";
+// A held start whose session went away without a stop (replaced by a new create).
+inline constexpr const char* kSessionEndedError = "com.orvane.vireo.Error.SessionEnded";
+// A call past one of the daemon's limits (limits.conf).
+inline constexpr const char* kLimitsExceededError = "org.freedesktop.DBus.Error.LimitsExceeded";
 
 }  // namespace vireo::bus
