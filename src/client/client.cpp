@@ -438,6 +438,28 @@ Status Client::ping() {
   return Done{};
 }
 
+Result<Dictionary> Client::getStatus() {
+  std::lock_guard lock(conn_->mu);
+  sd_bus_error e = SD_BUS_ERROR_NULL;
+  sd_bus_message* reply = nullptr;
+  int r = sd_bus_call_method(conn_->bus, kServiceName, kObjectPath, bus::kDebugInterface, "GetStatus", &e, &reply, "");
+  if (r < 0) {
+    Error err = errorFromBusError(&e, r, "GetStatus");
+    sd_bus_error_free(&e);
+    return err;
+  }
+  Message owned{reply};
+  Dictionary status;
+  r = dbus::readDictionary(owned.m, &status, &e);
+  if (r < 0) {
+    Error err{"org.freedesktop.DBus.Error.InvalidSignature",
+              std::string("unexpected answer: ") + (e.message ? e.message : ""), {}, 0};
+    sd_bus_error_free(&e);
+    return err;
+  }
+  return status;
+}
+
 Status Client::setInterfaceOrientation(const std::string& orientation) {
   std::lock_guard lock(conn_->mu);
   sd_bus_error e = SD_BUS_ERROR_NULL;

@@ -11,6 +11,7 @@
 #include "ctl/arguments.h"
 #include "ctl/defaults_command.h"
 #include "ctl/runner.h"
+#include "base/value.h"
 #include "ctl/store_query.h"
 #include "platform/linux/paths.h"
 #include "vireo/client.h"
@@ -23,6 +24,7 @@ constexpr const char* kHelp = R"(usage: vireoctl [OPTIONS] OPERATION [ARGS...] [
        vireoctl [OPTIONS] -            (or: script) operations from standard input, one per line
        vireoctl defaults read [KEY] | write KEY VALUE | delete KEY
        vireoctl notify [NAME]          (default com.orvane.vireo.reporting)
+       vireoctl status [--json]        the daemon's live state: clients, sessions, store, limits hit
        vireoctl orientation TEXT       report the interface orientation (normal, bottom-up,
                                        left-up, right-up, undefined), as the shell does
        vireoctl sessions|messages|analytics|energy [FILTERS] [--json]
@@ -187,6 +189,22 @@ int main(int argc, char** argv) {
       return 1;
     }
     if (o.json) std::printf("{\"op\":\"notify\",\"name\":\"%s\"}\n", name.c_str());
+    return 0;
+  }
+  if (command == "status") {
+    for (const auto& a : rest) {
+      if (a != "--json") return usageError("status takes only --json");
+      o.json = true;
+    }
+    auto c = connect(o);
+    auto status = c ? (*c)->getStatus() : client::Result<Dictionary>(c.error());
+    if (!status) {
+      std::fprintf(stderr, "vireoctl: status: %s: %s\n", status.error().name.c_str(), status.error().message.c_str());
+      return 1;
+    }
+    std::fputs(o.json ? (toJson(Value(*status), JsonMode::Lenient, true).value_or("{}") + "\n").c_str()
+                      : ctl::formatStatus(*status).c_str(),
+               stdout);
     return 0;
   }
   if (command == "orientation") {

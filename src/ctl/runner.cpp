@@ -186,4 +186,48 @@ bool Runner::run(const Operation& op) {
   return ok;
 }
 
+namespace {
+std::string textOf(const Dictionary& d, const char* key) {
+  const Value* v = d.find(key);
+  return v ? v->text() : "?";
+}
+}  // namespace
+
+std::string formatStatus(const Dictionary& status) {
+  std::string out = "sessions: " + textOf(status, "sessions") + " (" + textOf(status, "started_sessions") +
+                    " started), bus clients: " + textOf(status, "bus_clients") + "\n";
+  if (const Value* clients = status.find("clients"); clients && clients->asArray()) {
+    for (const Value& c : *clients->asArray()) {
+      const Dictionary* client = c.asDictionary();
+      if (!client) continue;
+      out += "  pid " + textOf(*client, "pid") + " " + textOf(*client, "process") + ":";
+      if (const Value* sessions = client->find("sessions"); sessions && sessions->asArray()) {
+        for (const Value& s : *sessions->asArray()) {
+          const Dictionary* session = s.asDictionary();
+          if (!session) continue;
+          const Value* started = session->find("started");
+          out += " " + textOf(*session, "reporterID") + " (" + textOf(*session, "serviceName") +
+                 (started && started->asBool() && *started->asBool() ? ", started)" : ")");
+        }
+      }
+      out += "\n";
+    }
+  }
+  if (const Value* store = status.find("store"); store && store->asDictionary()) {
+    const Dictionary& s = *store->asDictionary();
+    out += "store: " + textOf(s, "pending_rows") + " rows waiting, " + textOf(s, "refused_rows") + " refused, " +
+           textOf(s, "dropped_bad_rows") + " bad rows dropped, " + textOf(s, "write_errors") + " write errors";
+    if (const Value* e = s.find("last_error"); e && e->asString() && !e->asString()->empty())
+      out += " (last: " + *e->asString() + ")";
+    out += "\n";
+  }
+  out += "kept payloads dropped: " + textOf(status, "kept_payloads_dropped") + "\n";
+  out += "limits hit:";
+  const Value* hits = status.find("limits_hit");
+  if (!hits || !hits->asDictionary() || hits->asDictionary()->empty()) out += " none";
+  else
+    for (const auto& [limit, count] : *hits->asDictionary()) out += " " + limit.text() + "=" + count.text();
+  return out + "\n";
+}
+
 }  // namespace vireo::ctl

@@ -12,6 +12,9 @@
 
 namespace vireo::ctl {
 
+// The daemon's status as a few readable lines.
+std::string formatStatus(const Dictionary& status);
+
 class Runner {
  public:
   Runner(client::Client& client, bool json, std::FILE* out, std::FILE* err)

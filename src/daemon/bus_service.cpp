@@ -5,6 +5,7 @@
 #include <sys/signalfd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <new>
 #include <optional>
@@ -116,8 +117,14 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) { object.createReportingSession(id, answerBool(p)); });
-      return 1;
+      BusService& service = self(userdata);
+      // Creates and destroys are run in order, so this mirrors the client's session map.
+      auto& sessions = service.usageOf(m).sessions;
+      if (!sessions.contains(id) && sessions.size() >= service.limits_.maxSessionsPerClient)
+        return service.refuse(error, "MaxSessionsPerClient", service.limits_.maxSessionsPerClient,
+                              "more sessions than this client may hold");
+      sessions.insert(id);
+      return self(userdata).submit(m, error, [id](auto& object, auto& p) { object.createReportingSession(id, answerBool(p)); });
     });
   }
 
@@ -127,8 +134,7 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "qx", &type, &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [type, id](auto& object, auto& p) { object.setServiceType(type, id, answerBool(p)); });
-      return 1;
+      return self(userdata).submit(m, error, [type, id](auto& object, auto& p) { object.setServiceType(type, id, answerBool(p)); });
     });
   }
 
@@ -137,24 +143,22 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) {
+      return self(userdata).submit(m, error, [id](auto& object, auto& p) {
         object.getServiceNameForReporterID(id, [p](std::uint16_t type) { p->answer(serviceTypeReply(type)); });
       });
-      return 1;
     });
   }
 
   static int setConfiguration(sd_bus_message* m, void* userdata, sd_bus_error* error) {
     return guarded(error, [&] {
       Dictionary configuration;
-      int r = dbus::readDictionary(m, &configuration, error);
-      if (r < 0) return r;
+      int r = dbus::readDictionary(m, &configuration, error, self(userdata).decodeLimits_);
+      if (r < 0) return self(userdata).countDecodeRefusal(error), r;
       std::int64_t id = 0;
       if ((r = sd_bus_message_read(m, "x", &id)) < 0) return r;
-      self(userdata).submit(m, [configuration = std::move(configuration), id](auto& object, auto& p) {
+      return self(userdata).submit(m, error, [configuration = std::move(configuration), id](auto& object, auto& p) {
         object.setConfiguration(configuration, id, answerBool(p));
       });
-      return 1;
     });
   }
 
@@ -163,27 +167,47 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) {
-        object.startReportingSessionForID(id, StartReply(answerBool(p), [p] {
-                                            p->answer(Reply::error(bus::kSessionEndedError,
-                                                                   "the session ended without a stop"));
-                                          }));
+      BusService& service = self(userdata);
+      auto held = service.usageOf(m).heldStarts;
+      if (held->load() >= service.limits_.maxHeldStartsPerClient)
+        return service.refuse(error, "MaxHeldStartsPerClient", service.limits_.maxHeldStartsPerClient,
+                              "more unanswered starts than this client may have");
+      // Counts the start until it is answered, or dropped unanswered.
+      struct HeldStart {
+        explicit HeldStart(std::shared_ptr<std::atomic<std::size_t>> c) : count(std::move(c)) { ++*count; }
+        ~HeldStart() { release(); }
+        void release() {
+          if (!released.exchange(true)) --*count;
+        }
+        std::shared_ptr<std::atomic<std::size_t>> count;
+        std::atomic<bool> released{false};
+      };
+      auto token = std::make_shared<HeldStart>(std::move(held));
+      return service.submit(m, error, [id, token](auto& object, auto& p) {
+        object.startReportingSessionForID(id, StartReply(
+                                                  [p, token](bool b) {
+                                                    token->release();
+                                                    p->answer(boolReply(b));
+                                                  },
+                                                  [p, token] {
+                                                    token->release();
+                                                    p->answer(Reply::error(bus::kSessionEndedError,
+                                                                           "the session ended without a stop"));
+                                                  }));
       });
-      return 1;
     });
   }
 
   static int sendMessage(sd_bus_message* m, void* userdata, sd_bus_error* error) {
     return guarded(error, [&] {
       dbus::SendMessageArguments args;
-      int r = dbus::readSendMessageArguments(m, &args, error);
-      if (r < 0) return r;
+      int r = dbus::readSendMessageArguments(m, &args, error, self(userdata).decodeLimits_);
+      if (r < 0) return self(userdata).countDecodeRefusal(error), r;
       // Each submitted operation runs once, so its arguments are moved on, not copied.
-      self(userdata).submit(m, [args = std::move(args)](auto& object, auto& p) mutable {
+      return self(userdata).submit(m, error, [args = std::move(args)](auto& object, auto& p) mutable {
         object.sendMessage(std::move(args.payload), args.category, args.type, std::move(args.reporterIDs),
                            [p](std::optional<Error> e) { p->answer(errorReply(e)); });
       });
-      return 1;
     });
   }
 
@@ -192,8 +216,7 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) { object.stopReportingSessionForID(id, answerBool(p)); });
-      return 1;
+      return self(userdata).submit(m, error, [id](auto& object, auto& p) { object.stopReportingSessionForID(id, answerBool(p)); });
     });
   }
 
@@ -202,8 +225,9 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) { object.destroyReportingSession(id, answerBool(p)); });
-      return 1;
+      // ID 0 is never destroyed.
+      if (id != 0) self(userdata).usageOf(m).sessions.erase(id);
+      return self(userdata).submit(m, error, [id](auto& object, auto& p) { object.destroyReportingSession(id, answerBool(p)); });
     });
   }
 
@@ -212,19 +236,17 @@ struct BusServiceAccess {
       std::int64_t id = 0;
       int r = sd_bus_message_read(m, "x", &id);
       if (r < 0) return r;
-      self(userdata).submit(m, [id](auto& object, auto& p) {
+      return self(userdata).submit(m, error, [id](auto& object, auto& p) {
         object.reporterIDValid(id, [p](Dictionary info) { p->answer(reporterInfoReply(std::move(info))); });
       });
-      return 1;
     });
   }
 
   static int getAllReporters(sd_bus_message* m, void* userdata, sd_bus_error* error) {
     return guarded(error, [&] {
-      self(userdata).submit(m, [](auto& object, auto& p) {
+      return self(userdata).submit(m, error, [](auto& object, auto& p) {
         object.getAllReporters([p](std::vector<std::int64_t> ids) { p->answer(reporterListReply(std::move(ids))); });
       });
-      return 1;
     });
   }
 
@@ -243,10 +265,19 @@ struct BusServiceAccess {
     });
   }
 
+  static int getStatus(sd_bus_message* m, void* userdata, sd_bus_error* error) {
+    return guarded(error, [&] {
+      dbus::MessageRef reply;
+      int r = sd_bus_message_new_method_return(m, reply.out());
+      if (r < 0) return r;
+      if ((r = dbus::appendStringDictionary(reply.get(), self(userdata).status())) < 0) return r;
+      return sd_bus_send(nullptr, reply.get(), nullptr);
+    });
+  }
+
   static int killService(sd_bus_message* m, void* userdata, sd_bus_error* error) {
     return guarded(error, [&] {
-      self(userdata).submit(m, [](auto& object, auto& p) { object.killService(answerBool(p)); });
-      return 1;
+      return self(userdata).submit(m, error, [](auto& object, auto& p) { object.killService(answerBool(p)); });
     });
   }
 };
@@ -284,6 +315,12 @@ const sd_bus_vtable kReportingVtable[] = {
                   kMethodFlags | SD_BUS_VTABLE_METHOD_NO_REPLY),
     SD_BUS_VTABLE_END};
 
+const sd_bus_vtable kDebugVtable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_METHOD_WITH_NAMES("GetStatus", "", "", "a{sv}", SD_BUS_PARAM(status), BusServiceAccess::getStatus,
+                             kMethodFlags),
+    SD_BUS_VTABLE_END};
+
 const sd_bus_vtable kOrientationVtable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_METHOD_WITH_NAMES("SetInterfaceOrientation", "s", SD_BUS_PARAM(orientation), "", "",
@@ -302,13 +339,27 @@ BusService::~BusService() {
   close();
 }
 
+namespace {
+// The standard address of a bus, as sd_bus_open_system/user would find it.
+std::string standardAddress(BusKind kind) {
+  const char* variable = std::getenv(kind == BusKind::System ? "DBUS_SYSTEM_BUS_ADDRESS" : "DBUS_SESSION_BUS_ADDRESS");
+  if (variable && *variable) return variable;
+  if (kind == BusKind::System) return "unix:path=/run/dbus/system_bus_socket";
+  const char* runtime = std::getenv("XDG_RUNTIME_DIR");
+  return runtime && *runtime ? std::string("unix:path=") + runtime + "/bus" : std::string();
+}
+}  // namespace
+
 int BusService::connect(const Options& options) {
-  if (options.address.empty())
-    return options.bus == BusKind::System ? sd_bus_open_system(bus_.out()) : sd_bus_open_user(bus_.out());
+  const std::string address = options.address.empty() ? standardAddress(options.bus) : options.address;
+  if (address.empty()) return -ENOMEDIUM;
   int r = sd_bus_new(bus_.out());
   if (r < 0) return r;
-  if ((r = sd_bus_set_address(bus_.get(), options.address.c_str())) < 0) return r;
+  if ((r = sd_bus_set_address(bus_.get(), address.c_str())) < 0) return r;
   if ((r = sd_bus_set_bus_client(bus_.get(), 1)) < 0) return r;
+  // No file descriptors: the bus refuses calls that carry them, so a client
+  // cannot make us hold any.
+  if ((r = sd_bus_negotiate_fds(bus_.get(), 0)) < 0) return r;
   return sd_bus_start(bus_.get());
 }
 
@@ -334,6 +385,12 @@ int BusService::open(const Options& options) {
                                     this)) < 0)
     return fail("exporting the object");
   interfaceOrientation_ = options.interfaceOrientation;
+  limits_ = options.limits;
+  decodeLimits_ = {limits_.maxPayloadBytes, limits_.maxPayloadEntries, limits_.maxReporterIDsPerCall};
+  status_ = options.status;
+  if ((r = sd_bus_add_object_vtable(bus_.get(), debugSlot_.out(), kObjectPath, kDebugInterfaceName, kDebugVtable,
+                                    this)) < 0)
+    return fail("exporting the status interface");
   if ((r = sd_bus_add_object_vtable(bus_.get(), orientationSlot_.out(), kObjectPath, kOrientationInterfaceName,
                                     kOrientationVtable, this)) < 0)
     return fail("exporting the orientation interface");
@@ -398,6 +455,7 @@ void BusService::close() {
     lookups_.clear();
     objectSlot_.reset();
     orientationSlot_.reset();
+    debugSlot_.reset();
     nameOwnerSlot_.reset();
     postedSlot_.reset();
     mailboxSource_.reset();
@@ -410,10 +468,13 @@ void BusService::close() {
   });
 }
 
-void BusService::submit(sd_bus_message* call, Invocation invocation) {
-  auto pending = std::make_shared<PendingCall>(mailbox_, call);
+int BusService::submit(sd_bus_message* call, sd_bus_error* error, Invocation invocation) {
   const char* sender = sd_bus_message_get_sender(call);
-  registry_.call(sender ? sender : "", [pending, invocation = std::move(invocation)](PeerConnection* connection) {
+  const std::string name = sender ? sender : "";
+  if (!registry_.contains(name) && registry_.size() >= limits_.maxClients)
+    return refuse(error, "MaxClients", limits_.maxClients, "more clients than the service takes at once");
+  auto pending = std::make_shared<PendingCall>(mailbox_, call);
+  registry_.call(name, [pending, invocation = std::move(invocation)](PeerConnection* connection) {
     auto object = connection ? connection->exportedObject() : nullptr;
     if (!object) {
       pending->answer(Reply::error("org.freedesktop.DBus.Error.AccessDenied", "the connection was not accepted"));
@@ -421,6 +482,35 @@ void BusService::submit(sd_bus_message* call, Invocation invocation) {
     }
     invocation(*object, pending);
   });
+  return 1;
+}
+
+BusService::ClientUsage& BusService::usageOf(sd_bus_message* call) {
+  const char* sender = sd_bus_message_get_sender(call);
+  return usage_[sender ? sender : ""];
+}
+
+int BusService::refuse(sd_bus_error* error, const char* limit, std::size_t value, const char* what) {
+  ++limitsHit_[limit];
+  return sd_bus_error_setf(error, bus::kLimitsExceededError, "%s (%s=%zu)", what, limit, value);
+}
+
+void BusService::countDecodeRefusal(const sd_bus_error* error) {
+  if (!sd_bus_error_has_name(error, bus::kLimitsExceededError) || !error->message) return;
+  // The message names the limit as "MaxName=value".
+  std::string message = error->message;
+  auto begin = message.find("Max");
+  if (begin == std::string::npos) return;
+  ++limitsHit_[message.substr(begin, message.find('=', begin) - begin)];
+}
+
+Dictionary BusService::status() const {
+  Dictionary status = status_ ? status_() : Dictionary{};
+  status.set("bus_clients", Value(static_cast<unsigned long long>(registry_.size())));
+  Dictionary hits;
+  for (const auto& [limit, count] : limitsHit_) hits.set(Value(limit), Value(static_cast<unsigned long long>(count)));
+  status.set("limits_hit", Value(std::move(hits)));
+  return status;
 }
 
 void BusService::lookupCredentials(const std::string& name) {
@@ -462,7 +552,9 @@ int BusService::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_err
   if (sd_bus_message_read(m, "sss", &name, &oldOwner, &newOwner) < 0) return 0;
   if (name[0] != ':' || newOwner[0] != '\0') return 0;
   try {
-    static_cast<BusService*>(userdata)->registry_.nameVanished(name);
+    auto& self = *static_cast<BusService*>(userdata);
+    self.usage_.erase(name);
+    self.registry_.nameVanished(name);
   } catch (...) {
   }
   return 0;

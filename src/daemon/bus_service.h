@@ -15,12 +15,15 @@
 
 #include "vireo/bus_names.h"
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <map>
 #include <memory>
 #include <string>
 #include <thread>
+#include <unordered_map>
+#include <unordered_set>
 
 #include "daemon/bus_choice.h"
 #include "daemon/bus_mailbox.h"
@@ -28,6 +31,8 @@
 #include "daemon/notification_center.h"
 #include "platform/connection.h"
 #include "platform/dbus/bus.h"
+#include "platform/dbus/value_codec.h"
+#include "platform/limits.h"
 #include "platform/logger.h"
 #include "platform/orientation.h"
 
@@ -46,6 +51,7 @@ using bus::kReportingDisabledError;
 using bus::kServiceName;
 inline constexpr const char* kInterfaceName = bus::kInterface;
 inline constexpr const char* kOrientationInterfaceName = bus::kOrientationInterface;
+inline constexpr const char* kDebugInterfaceName = bus::kDebugInterface;
 inline constexpr const char* kDefaultsNotification = bus::kReportingNotification;
 
 // Blocks SIGTERM, SIGINT and SIGHUP in the calling thread (and the threads it makes).
@@ -61,6 +67,10 @@ class BusService {
     bool handleSignals = true;
     // Receives the interface orientation that the shell pushes (on the bus thread).
     std::function<void(Orientation)> interfaceOrientation;
+    // What one client may make the daemon hold.
+    ServiceLimits limits;
+    // The engine's and the store's part of Debug1.GetStatus (on the bus thread).
+    std::function<Dictionary()> status;
   };
 
   BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications);
@@ -88,7 +98,20 @@ class BusService {
   struct CredentialLookup;
   using Invocation = std::function<void(VRReportingServiceProtocol& object, const std::shared_ptr<PendingCall>&)>;
 
-  void submit(sd_bus_message* call, Invocation invocation);
+  // What a client holds, counted against the limits; bus thread only.
+  struct ClientUsage {
+    std::unordered_set<std::int64_t> sessions;
+    std::shared_ptr<std::atomic<std::size_t>> heldStarts = std::make_shared<std::atomic<std::size_t>>(0);
+  };
+
+  // Hands the call to its client's object; refuses a new client past MaxClients.
+  int submit(sd_bus_message* call, sd_bus_error* error, Invocation invocation);
+  ClientUsage& usageOf(sd_bus_message* call);
+  // Fails the call with LimitsExceeded naming the limit, and counts it.
+  int refuse(sd_bus_error* error, const char* limit, std::size_t value, const char* what);
+  // Counts a refusal the value decoder made (its message names the limit).
+  void countDecodeRefusal(const sd_bus_error* error);
+  Dictionary status() const;
   void lookupCredentials(const std::string& name);
   static int onCredentials(sd_bus_message* reply, void* userdata, sd_bus_error* error);
   static int onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
@@ -105,7 +128,12 @@ class BusService {
   // runs, and to close() (through the closed mailbox) after it.
   dbus::BusRef bus_;
   dbus::EventRef event_;
-  dbus::SlotRef objectSlot_, orientationSlot_, nameOwnerSlot_, postedSlot_;
+  dbus::SlotRef objectSlot_, orientationSlot_, debugSlot_, nameOwnerSlot_, postedSlot_;
+  ServiceLimits limits_;                                  // set by open()
+  dbus::DecodeLimits decodeLimits_;                       // set by open()
+  std::function<Dictionary()> status_;                    // set by open()
+  std::unordered_map<std::string, ClientUsage> usage_;    // by unique name; bus thread only
+  std::map<std::string, std::uint64_t> limitsHit_;        // by limit name; bus thread only
   std::function<void(Orientation)> interfaceOrientation_;  // set by open(), read on the bus thread
   dbus::EventSourceRef mailboxSource_, termSource_, intSource_, hupSource_;
   std::map<std::string, std::unique_ptr<CredentialLookup>> lookups_;  // by name; bus thread only

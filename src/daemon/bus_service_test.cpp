@@ -201,7 +201,7 @@ TEST_F(BusServiceTest, TheNameCanBeOwnedOnce) {
 std::string interfaceBlocks(std::string xml) {
   std::erase_if(xml, [](unsigned char c) { return std::isspace(c); });
   std::string blocks;
-  for (const char* name : {kInterfaceName, kOrientationInterfaceName}) {
+  for (const char* name : {kInterfaceName, kDebugInterfaceName, kOrientationInterfaceName}) {
     auto begin = xml.find(std::string("<interfacename=\"") + name + "\">");
     blocks += begin == std::string::npos ? "" : xml.substr(begin, xml.find("</interface>", begin) - begin);
   }

@@ -68,6 +68,7 @@ class ClientRegistry {
   void nameVanished(const std::string& name);
 
   std::size_t size() const { return clients_.size(); }
+  bool contains(const std::string& name) const { return clients_.contains(name); }
 
  private:
   struct Client {

@@ -1,12 +1,16 @@
 // vireo-reportingd: the reporting daemon of the audio stack.
+#include <sys/resource.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <functional>
 #include <memory>
+#include <string>
+#include <vector>
 
 #include "daemon/bus_choice.h"
 #include "daemon/bus_service.h"
@@ -16,6 +20,7 @@
 #include "platform/linux/defaults_store.h"
 #include "platform/linux/device_properties.h"
 #include "platform/linux/diagnostic_files.h"
+#include "platform/linux/limits_file.h"
 #include "platform/linux/linux_logger.h"
 #include "platform/linux/paths.h"
 #include "platform/linux/process_table.h"
@@ -25,6 +30,7 @@
 #include "platform/linux/usdt_tracer.h"
 #include "platform/platform.h"
 #include "service/service_delegate.h"
+#include "service/service_status.h"
 #include "vocabulary/reporting_environment.h"
 
 namespace {
@@ -49,6 +55,29 @@ class ExitProcessControl final : public ProcessControl {
  private:
   const std::function<void()> beforeExit_;
 };
+
+// A held call keeps no descriptor (they are refused on the bus), but the store,
+// the buses and the statistics tree need some: take what the hard limit allows,
+// as systemd services get.
+void raiseOpenFileLimit(Logger& logger) {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max) return;
+  limit.rlim_cur = limit.rlim_max;
+  if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
+    VR_LOG(logger, LogScope::DefaultLog, LogLevel::Error, "main", "could not raise the open-file limit: %s",
+           std::strerror(errno));
+}
+
+Dictionary storeStatus(const linux_platform::LocalStore& store) {
+  auto s = store.status();
+  return Dictionary{{"usable", Value(s.usable)},
+                    {"pending_rows", Value(static_cast<unsigned long long>(s.pendingRows))},
+                    {"pending_bytes", Value(static_cast<unsigned long long>(s.pendingBytes))},
+                    {"refused_rows", Value(static_cast<unsigned long long>(s.refusedRows))},
+                    {"dropped_bad_rows", Value(static_cast<unsigned long long>(s.droppedBadRows))},
+                    {"write_errors", Value(static_cast<unsigned long long>(s.writeErrors))},
+                    {"last_error", Value(s.lastError)}};
+}
 
 void usage(FILE* out) {
   std::fprintf(out,
@@ -94,11 +123,20 @@ int main(int argc, char** argv) {
          directories.configuration.c_str(), directories.state.c_str(), directories.logs.c_str(),
          directories.runtime.c_str());
 
+  raiseOpenFileLimit(*logger);
+  std::vector<std::string> limitProblems;
+  const ServiceLimits limits =
+      linux_platform::readLimitsFile(directories.configuration + "/limits.conf", &limitProblems);
+  for (const auto& problem : limitProblems)
+    VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Error, "main", "limits.conf: %s", problem.c_str());
+
   linux_platform::UsdtTracer tracer;
   linux_platform::SystemClock clock;
   linux_platform::SystemRandom random;
   ThreadPoolDispatcher dispatcher;
-  linux_platform::LocalStoreServices store(directories, *logger, clock);
+  linux_platform::LocalStore::Options storeOptions;
+  storeOptions.maxPendingRows = limits.maxQueuedRows;
+  linux_platform::LocalStoreServices store(directories, *logger, clock, storeOptions);
   linux_platform::SuiteFileDefaultsStore defaults(directories.configuration);
   daemon::NotificationCenter notifications;
   linux_platform::DevicePropertiesFile device(directories.configuration);
@@ -125,6 +163,7 @@ int main(int argc, char** argv) {
   };
 
   auto environment = std::make_shared<ReportingEnvironment>(platform);
+  environment->maxKeptBytesPerSession = limits.maxKeptBytesPerSession;
   auto delegate = VRReportingServiceDelegate::init(environment);
   if (!delegate) {
     VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Error, "main", "the service could not be initialised");
@@ -134,6 +173,12 @@ int main(int argc, char** argv) {
   daemon::BusService service(*logger, *delegate, notifications);
   daemon::BusService::Options options;
   options.interfaceOrientation = [&orientation](Orientation o) { orientation.pushInterfaceOrientation(o); };
+  options.limits = limits;
+  options.status = [&] {
+    Dictionary status = serviceStatus(*delegate, *environment);
+    status.set("store", Value(storeStatus(*store.store)));
+    return status;
+  };
   options.bus = daemon::chooseBus(std::getenv("VIREO_BUS"), std::getenv("DBUS_STARTER_BUS_TYPE"), geteuid() == 0);
   if (service.open(options) < 0) return finish(1);
 

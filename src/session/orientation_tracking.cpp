@@ -79,8 +79,7 @@ void VRReportingSession::orientationChanged(const char* mode, Orientation orient
   const std::string prefix(mode);
   Dictionary entry{{Value(prefix + "_orientation"), Value(text)},
                    {Value(prefix + "_orientation_time"), Value(elapsed)}};
-  std::lock_guard<std::mutex> guard(payloads->lock);
-  payloads->entries.emplace_back(std::move(entry));
+  keep(*payloads, Value(std::move(entry)));
 }
 
 }  // namespace vireo

@@ -184,8 +184,7 @@ void VRReportingSession::sendMessage(const Dictionary& message, std::uint32_t ca
   if (auto payloads = aggregatedPayloadData()) {
     Dictionary entry;
     entry.set(Value(std::move(identifier)), cleaned);
-    std::lock_guard<std::mutex> guard(payloads->lock);
-    payloads->entries.emplace_back(std::move(entry));
+    keep(*payloads, Value(std::move(entry)));
   }
   env_->platform.tracer.emit(trace::kSessionSend);
 
@@ -226,6 +225,45 @@ void VRReportingSession::deliver(const Dictionary& cleaned, const Value& receive
              telemetry->description().c_str(), received.text().c_str(), static_cast<int>(category),
              static_cast<int>(type));
   }
+}
+
+std::size_t AggregatedPayloads::appendLocked(Value entry, std::size_t budget, bool front) {
+  const std::size_t bytes = payloadFootprint(entry);
+  if (front) {
+    entries.push_front(std::move(entry));
+    sizes.push_front(bytes);
+  } else {
+    entries.push_back(std::move(entry));
+    sizes.push_back(bytes);
+  }
+  keptBytes += bytes;
+  std::size_t droppedNow = 0;
+  // The newest entry always stays, however big.
+  while (keptBytes > budget && entries.size() > 1) {
+    keptBytes -= sizes.front();
+    entries.pop_front();
+    sizes.pop_front();
+    ++droppedNow;
+  }
+  dropped += droppedNow;
+  return droppedNow;
+}
+
+void VRReportingSession::keep(AggregatedPayloads& payloads, Value entry) {
+  const std::size_t budget = env_->maxKeptBytesPerSession.load();
+  std::size_t dropped;
+  bool first;
+  {
+    std::lock_guard<std::mutex> guard(payloads.lock);
+    dropped = payloads.appendLocked(std::move(entry), budget);
+    first = dropped > 0 && payloads.dropped == dropped;
+  }
+  if (dropped == 0) return;
+  env_->keptPayloadsDropped += dropped;
+  if (first)
+    VR_LOG(env_->logger(), LogScope::Session, LogLevel::Default, "-[VRReportingSession sendMessage:category:type:sync:reply:]",
+           "session %lli keeps more than MaxKeptBytesPerSession=%zu bytes for its summary: dropping the oldest",
+           static_cast<long long>(reporterID_), budget);
 }
 
 // ---------------------------------------------------------------- telemetry backend

@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <deque>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -29,10 +30,19 @@ class ReportingEnvironment;
 
 // The gathered payloads of a running session with the lock that guards them. Each
 // start makes a new one; stop drops it, so a sender that still holds the old one
-// appends to an array nobody reads any more.
+// appends to an array nobody reads any more. What is kept is bounded: past the
+// byte budget the oldest entries go first.
 struct AggregatedPayloads {
   std::mutex lock;
-  Array entries;  // guarded by lock
+  std::deque<Value> entries;       // guarded by lock
+  std::deque<std::size_t> sizes;   // guarded by lock: the footprint of each entry
+  std::size_t keptBytes = 0;       // guarded by lock
+  std::uint64_t dropped = 0;       // guarded by lock: entries let go for the budget
+
+  // With lock held: appends at the end (or, with front, at the start) and drops the
+  // oldest entries while over budget. Returns how many it dropped.
+  std::size_t appendLocked(Value entry, std::size_t budget, bool front = false);
+  Array arrayLocked() const { return Array(entries.begin(), entries.end()); }
 };
 
 class VRReportingSession : public std::enable_shared_from_this<VRReportingSession> {
@@ -102,6 +112,8 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
   void registerOrientationHandlers();
   void unregisterOrientationHandlers();
   void orientationChanged(const char* mode, Orientation orientation);
+  // Appends one entry to payloads within the session's budget, logging the first drop.
+  void keep(AggregatedPayloads& payloads, Value entry);
   void deliver(const Dictionary& cleaned, const Value& received, bool submittedWhileStarted,
                std::uint32_t category, std::uint16_t type);
 

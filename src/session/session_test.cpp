@@ -36,14 +36,14 @@ class SessionTest : public ::testing::Test {
     s->start();
     auto array = s->aggregatedPayloadData();
     std::lock_guard<std::mutex> guard(array->lock);
-    for (auto& d : payloads) array->entries.emplace_back(std::move(d));
+    for (auto& d : payloads) array->appendLocked(Value(std::move(d)), std::numeric_limits<std::size_t>::max());
     return s;
   }
   static Array entries(const VRReportingSession& s) {
     auto payloads = s.aggregatedPayloadData();
     if (!payloads) return {};
     std::lock_guard<std::mutex> guard(payloads->lock);
-    return payloads->entries;
+    return payloads->arrayLocked();
   }
 
   FakePlatform p;
@@ -290,6 +290,22 @@ TEST_F(SessionTest, SummaryJoinsValuesPerKeyAndInsertsUserInfo) {
   p.dispatcher.runAll();
   EXPECT_FALSE(p.logger.contains("sending summary event"));
   EXPECT_TRUE(p.telemetry.lastSession()->sent().empty());
+}
+
+TEST_F(SessionTest, KeptPayloadsStayWithinTheirBudgetOldestDroppedFirst) {
+  auto s = make(2);
+  s->start();
+  const std::size_t one = payloadFootprint(Value(Dictionary{{"Routing_Playback_Start_1", Dictionary{{"n", 1}}}}));
+  p.env->maxKeptBytesPerSession = 3 * one + one / 2;
+  for (int n = 1; n <= 6; ++n) s->sendMessage(Dictionary{{"n", n}}, 0x40000003, 1, nullptr);
+  Array kept = entries(*s);
+  ASSERT_EQ(kept.size(), 3u);
+  EXPECT_EQ(kept[0], Value(Dictionary{{"Routing_Playback_Start_4", Dictionary{{"n", 4}}}}));
+  EXPECT_EQ(p.env->keptPayloadsDropped.load(), 3u);
+  EXPECT_EQ(p.logger.count("keeps more than MaxKeptBytesPerSession="), 1u);  // once per session
+  // Every message is still delivered; only what the summary keeps is bounded.
+  p.dispatcher.runAll();
+  EXPECT_EQ(p.telemetry.lastSession()->sent().size(), 6u);
 }
 
 TEST_F(SessionTest, SummaryFilesOnInternalBuilds) {

@@ -1,6 +1,7 @@
 // createSummaryEventForSession: the flat summary sent at stop and, on internal
 // builds, the session's payloads as a pretty JSON file in the diagnostic logs.
 #include <ctime>
+#include <limits>
 #include <string>
 #include <utility>
 #include <vector>
@@ -80,7 +81,7 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
   const Dictionary info = userInfo();
   {
     std::lock_guard<std::mutex> guard(payloads->lock);
-    payloads->entries.insert(payloads->entries.begin(), Value(info));
+    payloads->appendLocked(Value(info), std::numeric_limits<std::size_t>::max(), true);
   }
 
   if (!VRReportingIsInternalBuild(*env_)) return result;
@@ -95,7 +96,7 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
   {
     std::lock_guard<std::mutex> guard(payloads->lock);
     JsonError jsonError;
-    text = toJson(Value(payloads->entries), JsonMode::Strict, true, &jsonError);
+    text = toJson(Value(payloads->arrayLocked()), JsonMode::Strict, true, &jsonError);
     if (!text) error = Error{kGeneralErrorDomain, 0, jsonError.message};
   }
   if (!text) VR_LOG(logger, LogScope::Session, LogLevel::Error, kLabel, "dataWithJSONObject: %s", error->description.c_str());

@@ -3,6 +3,8 @@
 #pragma once
 
 #include <atomic>
+#include <cstddef>
+#include <cstdint>
 #include <mutex>
 
 #include "platform/platform.h"
@@ -21,6 +23,10 @@ class ReportingEnvironment {
   // How long a session waits for the telemetry service to find backends before it
   // logs and waits again; tests shorten it.
   std::atomic<double> backendWaitInterval{9.0};
+  // Bytes of payloads one session keeps for its summary (limits.conf MaxKeptBytesPerSession).
+  std::atomic<std::size_t> maxKeptBytesPerSession{4u << 20};
+  // Payloads let go for that budget, over the process's life.
+  std::atomic<std::uint64_t> keptPayloadsDropped{0};
 
   // VRReportingIsInternalBuild: the device's "InternalBuild" answer, false without one.
   bool isInternalBuild() {

@@ -6,6 +6,8 @@ namespace vireo::bus {
 inline constexpr const char* kServiceName = "com.orvane.vireo.Reporting1";
 inline constexpr const char* kObjectPath = "/com/orvane/vireo/Reporting1";
 inline constexpr const char* kInterface = "com.orvane.vireo.Reporting1";
+// GetStatus() -> a{sv}, on the same object: the daemon's live state.
+inline constexpr const char* kDebugInterface = "com.orvane.vireo.Debug1";
 // SetInterfaceOrientation(s), on the same object: the shell reports how its interface is turned.
 inline constexpr const char* kOrientationInterface = "com.orvane.vireo.Orientation1";
 // The defaults change notification: Posted(s name) on this path and interface.

@@ -145,6 +145,8 @@ class Client {
 
   // Posts the notification (the Posted(s) signal of com.orvane.Notify1).
   Status postNotification(const std::string& name);
+  // The daemon's live state (com.orvane.vireo.Debug1.GetStatus).
+  Result<Dictionary> getStatus();
   // Reports the user interface's orientation ("normal", "bottom-up", "left-up",
   // "right-up" or "undefined"), as the shell does.
   Status setInterfaceOrientation(const std::string& orientation);
