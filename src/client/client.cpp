@@ -245,6 +245,19 @@ Result<sd_bus_message*> call(Connection& c, const char* method, Fill&& fill) {
 
 int noArgs(sd_bus_message*) { return 0; }
 
+// An a{sv} answer.
+Result<Dictionary> readDictionaryAnswer(sd_bus_message* m) {
+  Dictionary d;
+  sd_bus_error e = SD_BUS_ERROR_NULL;
+  if (dbus::readDictionary(m, &d, &e) < 0) {
+    Error err{"org.freedesktop.DBus.Error.InvalidSignature",
+              std::string("unexpected answer: ") + (e.message ? e.message : ""), {}, 0};
+    sd_bus_error_free(&e);
+    return err;
+  }
+  return d;
+}
+
 Result<bool> boolCall(Connection& c, const char* method, auto&& fill) {
   auto reply = call(c, method, fill);
   if (!reply) return reply.error();
@@ -396,15 +409,9 @@ Result<ReporterInfo> Client::reporterIDValid(std::int64_t id) {
   auto reply = call(*conn_, "ReporterIDValid", [&](sd_bus_message* m) { return sd_bus_message_append(m, "x", id); });
   if (!reply) return reply.error();
   Message owned{*reply};
-  Dictionary d;
-  sd_bus_error e = SD_BUS_ERROR_NULL;
-  int r = dbus::readDictionary(owned.m, &d, &e);
-  if (r < 0) {
-    Error err{"org.freedesktop.DBus.Error.InvalidSignature",
-              std::string("unexpected answer: ") + (e.message ? e.message : ""), {}, 0};
-    sd_bus_error_free(&e);
-    return err;
-  }
+  auto answer = readDictionaryAnswer(owned.m);
+  if (!answer) return answer.error();
+  const Dictionary& d = *answer;
   ReporterInfo info;
   if (const Value* v = d.find("reporterID")) info.reporterID = v->toInt64().value_or(0);
   if (const Value* v = d.find("serviceType")) info.serviceType = static_cast<std::uint16_t>(v->toInt64().value_or(0));
@@ -449,15 +456,7 @@ Result<Dictionary> Client::getStatus() {
     return err;
   }
   Message owned{reply};
-  Dictionary status;
-  r = dbus::readDictionary(owned.m, &status, &e);
-  if (r < 0) {
-    Error err{"org.freedesktop.DBus.Error.InvalidSignature",
-              std::string("unexpected answer: ") + (e.message ? e.message : ""), {}, 0};
-    sd_bus_error_free(&e);
-    return err;
-  }
-  return status;
+  return readDictionaryAnswer(owned.m);
 }
 
 Status Client::setInterfaceOrientation(const std::string& orientation) {

@@ -182,42 +182,40 @@ void SensorOrientationService::pushInterfaceOrientation(Orientation orientation)
   mailbox_->post([this, orientation] { deliver(interfaceHandlers_, orientation); });
 }
 
+// Both return the handler they take out, to be released outside the lock: it may hold a session.
+OrientationHandler SensorOrientationService::setHandler(Handlers& handlers, const std::string& identifier,
+                                                        OrientationHandler handler) {
+  std::lock_guard guard(lock_);
+  return std::exchange(handlers[identifier], std::move(handler));
+}
+
+OrientationHandler SensorOrientationService::removeHandler(Handlers& handlers, const std::string& identifier) {
+  std::lock_guard guard(lock_);
+  auto it = handlers.find(identifier);
+  if (it == handlers.end()) return {};
+  OrientationHandler removed = std::move(it->second);
+  handlers.erase(it);
+  return removed;
+}
+
 void SensorOrientationService::registerDeviceOrientationHandler(const std::string& identifier,
                                                                 OrientationHandler handler) {
-  OrientationHandler replaced;  // may hold a session: released outside the lock
-  {
-    std::lock_guard guard(lock_);
-    replaced = std::exchange(deviceHandlers_[identifier], std::move(handler));
-  }
+  setHandler(deviceHandlers_, identifier, std::move(handler));
   mailbox_->post([this] { reconcileClaim(); });
 }
 
 void SensorOrientationService::registerInterfaceOrientationHandler(const std::string& identifier,
                                                                    OrientationHandler handler) {
-  OrientationHandler replaced;
-  std::lock_guard guard(lock_);
-  replaced = std::exchange(interfaceHandlers_[identifier], std::move(handler));
+  setHandler(interfaceHandlers_, identifier, std::move(handler));
 }
 
 void SensorOrientationService::unregisterDeviceOrientationHandler(const std::string& identifier) {
-  OrientationHandler removed;
-  {
-    std::lock_guard guard(lock_);
-    if (auto it = deviceHandlers_.find(identifier); it != deviceHandlers_.end()) {
-      removed = std::move(it->second);
-      deviceHandlers_.erase(it);
-    }
-  }
+  removeHandler(deviceHandlers_, identifier);
   mailbox_->post([this] { reconcileClaim(); });
 }
 
 void SensorOrientationService::unregisterInterfaceOrientationHandler(const std::string& identifier) {
-  OrientationHandler removed;
-  std::lock_guard guard(lock_);
-  if (auto it = interfaceHandlers_.find(identifier); it != interfaceHandlers_.end()) {
-    removed = std::move(it->second);
-    interfaceHandlers_.erase(it);
-  }
+  removeHandler(interfaceHandlers_, identifier);
 }
 
 int SensorOrientationService::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error*) {

@@ -56,6 +56,8 @@ class SensorOrientationService final : public OrientationService {
   void proxyOwnerChanged(std::string owner);
   void reconcileClaim();
   void deliver(Handlers& handlers, Orientation orientation);
+  OrientationHandler setHandler(Handlers& handlers, const std::string& identifier, OrientationHandler handler);
+  OrientationHandler removeHandler(Handlers& handlers, const std::string& identifier);
   static int onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
   static int onInitialOwner(sd_bus_message* m, void* userdata, sd_bus_error* error);
   static int onPropertiesChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
