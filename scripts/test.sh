@@ -1,8 +1,23 @@
 #!/usr/bin/env bash
-# Builds Vireo with AddressSanitizer and UndefinedBehaviorSanitizer and runs every test.
+# Builds Vireo and runs every test three ways: under AddressSanitizer and
+# UndefinedBehaviorSanitizer (GCC), under ThreadSanitizer (Clang), and the libFuzzer
+# targets for VIREO_FUZZ_SECONDS each (default 30). Each preset has its own build/<preset>.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
-cmake --preset ci
-cmake --build --preset ci
-ctest --preset ci
+
+# stage PRESET [CONFIGURE-ARGS...]
+stage() {
+  local name=$1
+  shift
+  local start=$SECONDS
+  echo "==== $name" >&2
+  cmake --preset "$name" "$@"
+  cmake --build --preset "$name"
+  ctest --preset "$name"
+  echo "==== $name: $((SECONDS - start)) s" >&2
+}
+
+stage ci
+stage tsan
+stage fuzz -DVIREO_FUZZ_SECONDS="${VIREO_FUZZ_SECONDS:-30}"

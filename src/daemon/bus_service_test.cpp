@@ -99,6 +99,7 @@ class BusServiceTest : public ::testing::Test {
       _exit(127);
     }
     close(out[1]);
+    address_.clear();  // a repeated suite starts a new bus
     for (char c; read(out[0], &c, 1) == 1 && c != '\n';) address_ += c;
     close(out[0]);
     setenv("DBUS_SESSION_BUS_ADDRESS", address_.c_str(), 1);
