@@ -1,9 +1,10 @@
 // Serial queues and the shared low-priority queue.
 //
 // A serial queue runs its closures one at a time, in submission order, on threads
-// of a small shared pool; a queue costs memory, not a thread. A closure that may
-// block for long (waiting for a backend) marks the wait with BlockingRegion, so the
-// pool can lend another thread to the other queues meanwhile.
+// of a small fixed pool; a queue costs memory, not a thread. A closure that has to
+// wait for something (a backend's answer) never blocks its thread for it: it parks
+// its queue and returns, and the queue goes on when whoever answers resumes it, or
+// when the park's deadline passes.
 #pragma once
 
 #include <chrono>
@@ -18,12 +19,31 @@ using Task = std::function<void()>;
 // Quality-of-service classes, highest first.
 enum class QoS { UserInteractive, UserInitiated, Default, Utility, Background };
 
+// The way back for a parked serial queue. Thread-safe; may outlive its queue.
+class Parking {
+ public:
+  virtual ~Parking() = default;
+  // Lets the queue go on, running next (when not empty) before anything queued
+  // behind the park. Only the first of resume() and the deadline counts: false when
+  // the park has already ended (resumed, timed out, or dropped at shutdown), and
+  // next is then released unrun.
+  virtual bool resume(Task next) = 0;
+};
+
 class SerialQueue {
  public:
   virtual ~SerialQueue() = default;
   // Submits without waiting.
   virtual void async(Task task) = 0;
   virtual const std::string& label() const = 0;
+  // Parks the queue: once the closure running on it returns (at once if none is
+  // running), the queue runs nothing more, and holds no thread, until the returned
+  // Parking is resumed or timeout passes; on timeout, onTimeout runs first. Closures
+  // submitted meanwhile wait, in order. Usually called by the queue's own closure
+  // that starts a wait. One park at a time: while one is pending, or once the
+  // dispatcher has shut down, the returned Parking is already spent (resume() is
+  // false), the queue is not parked again and onTimeout is released unrun.
+  virtual std::shared_ptr<Parking> park(std::chrono::nanoseconds timeout, Task onTimeout) = 0;
 };
 
 class Dispatcher {
@@ -33,31 +53,6 @@ class Dispatcher {
   // The shared low-priority concurrent queue: task runs after delay, possibly at the
   // same time as other tasks of this queue.
   virtual void asyncLowPriority(std::chrono::nanoseconds delay, Task task) = 0;
-};
-
-// Marks the current thread as blocked for the region's lifetime. On a pool thread,
-// the pool may start a stand-in so that other queues keep running; elsewhere it does
-// nothing.
-class BlockingRegion {
- public:
-  BlockingRegion();
-  ~BlockingRegion();
-  BlockingRegion(const BlockingRegion&) = delete;
-  BlockingRegion& operator=(const BlockingRegion&) = delete;
-
-  // Implemented by the pool and installed per worker thread.
-  class Observer {
-   public:
-    virtual void blockingBegan() = 0;
-    virtual void blockingEnded() = 0;
-
-   protected:
-    ~Observer() = default;
-  };
-  static void setThreadObserver(Observer* observer);
-
- private:
-  Observer* observer_;
 };
 
 }  // namespace vireo

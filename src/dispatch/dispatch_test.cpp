@@ -45,9 +45,26 @@ class Countdown {
 
 ThreadPoolDispatcher::Options small(std::size_t workers) {
   ThreadPoolDispatcher::Options o;
-  o.coreWorkers = workers;
+  o.workers = workers;
   return o;
 }
+
+// What ran, in order, across threads.
+class Trail {
+ public:
+  void add(std::string step) {
+    std::lock_guard lock(mu_);
+    steps_.push_back(std::move(step));
+  }
+  std::vector<std::string> steps() const {
+    std::lock_guard lock(mu_);
+    return steps_;
+  }
+
+ private:
+  mutable std::mutex mu_;  // guards steps_
+  std::vector<std::string> steps_;
+};
 
 // Many producers feed many queues; every closure checks that it is alone on its
 // queue and that each producer's sequence numbers arrive in order.
@@ -120,59 +137,130 @@ TEST(SerialQueue, TenThousandQueuesShareAFewThreads) {
   EXPECT_EQ(pool.workerCount(), 3u);
 }
 
-TEST(BlockingRegion, BlockedQueuesDoNotStallOtherQueuesAndStandInsAreCapped) {
-  ThreadPoolDispatcher::Options o = small(2);
-  o.extraIdleTimeout = 50ms;
-  o.maxExtraWorkers = 2;
-  ThreadPoolDispatcher pool(o);
-  std::promise<void> release;
-  std::shared_future<void> released = release.get_future().share();
-  // Both core workers block; the other queues still complete thanks to stand-ins.
-  Countdown entered(2);
-  std::vector<std::shared_ptr<SerialQueue>> queues;
-  for (int i = 0; i < 2; ++i) {
-    queues.push_back(pool.makeSerialQueue("blocked", QoS::Utility));
-    queues.back()->async([&, released] {
-      BlockingRegion outer;
-      BlockingRegion nested;  // counted once
-      entered.arrive();
-      released.wait_for(20s);
+// Two workers, ten thousand parked queues: another queue still gets a thread. A
+// resume from a thread outside the pool then lets every queue go on, its resume
+// closure first and what waited behind the park after it.
+TEST(Park, TenThousandParkedQueuesHoldNoThreadAndResumeInOrder) {
+  constexpr int kQueues = 10000;
+  const int before = threadsOfProcess();
+  ThreadPoolDispatcher pool(small(2));
+  struct Parked {
+    std::shared_ptr<SerialQueue> queue;
+    std::shared_ptr<Parking> parking;
+    std::vector<int> steps;  // touched only by the queue's closures, read after drain
+  };
+  std::vector<Parked> all(kQueues);
+  Countdown parked(kQueues);
+  for (auto& q : all) {
+    q.queue = pool.makeSerialQueue("parked", QoS::Utility);
+    q.queue->async([&q, &parked] {
+      q.steps.push_back(1);
+      q.parking = q.queue->park(std::chrono::hours(1), [&q] { q.steps.push_back(-1); });
+      parked.arrive();
     });
+    q.queue->async([&q] { q.steps.push_back(3); });
   }
-  ASSERT_TRUE(entered.wait());
-  Countdown others(100);
-  for (int i = 0; i < 100; ++i) {
-    queues.push_back(pool.makeSerialQueue("free", QoS::Default));
-    queues.back()->async([&] { others.arrive(); });
-  }
-  EXPECT_TRUE(others.wait());
-  EXPECT_GE(pool.workerCount(), 3u);
-
-  // Blocking stand-ins too: never more than maxExtraWorkers of them.
-  Countdown standIns(2);
-  std::atomic<int> done{0};
-  for (int i = 0; i < 4; ++i) {
-    queues.push_back(pool.makeSerialQueue("capped", QoS::Default));
-    queues.back()->async([&, released] {
-      BlockingRegion region;
-      standIns.arrive();
-      released.wait_for(20s);
-      ++done;
-    });
-  }
-  ASSERT_TRUE(standIns.wait());
-  std::this_thread::sleep_for(50ms);
-  EXPECT_EQ(pool.workerCount(), 4u);
-  EXPECT_EQ(done.load(), 0);
-  EXPECT_FALSE(pool.drain(20ms));  // the blocked closures are still pending
-
-  release.set_value();
-  ASSERT_TRUE(pool.drain(10s));
-  EXPECT_EQ(done.load(), 4);
-  // The stand-ins leave once idle.
-  auto deadline = std::chrono::steady_clock::now() + 10s;
-  while (pool.workerCount() > 2 && std::chrono::steady_clock::now() < deadline) std::this_thread::sleep_for(10ms);
+  ASSERT_TRUE(parked.wait(60s));
+  Countdown other(1);
+  auto free = pool.makeSerialQueue("free", QoS::Utility);
+  free->async([&] { other.arrive(); });
+  EXPECT_TRUE(other.wait());
   EXPECT_EQ(pool.workerCount(), 2u);
+  EXPECT_LE(threadsOfProcess(), before + 3);  // two workers and the timer
+  EXPECT_FALSE(pool.drain(0ms));              // the parks are awaited work
+
+  std::thread completions([&] {
+    for (auto& q : all) EXPECT_TRUE(q.parking->resume([&q] { q.steps.push_back(2); }));
+  });
+  completions.join();
+  ASSERT_TRUE(pool.drain(60s));
+  for (auto& q : all) ASSERT_EQ(q.steps, (std::vector<int>{1, 2, 3}));
+  EXPECT_FALSE(all[0].parking->resume([] {}));
+}
+
+// Whichever comes first ends the park: the deadline runs the timeout closure ahead
+// of the queue and refuses a later resume; an earlier resume lets the timeout
+// closure go at once, not when its deadline passes.
+TEST(Park, DeadlineOrResumeWhicheverComesFirstAndOneParkAtATime) {
+  ThreadPoolDispatcher pool(small(2));
+  auto q = pool.makeSerialQueue("timed", QoS::Default);
+  Trail trail;
+  std::shared_ptr<Parking> parking;
+  q->async([&] { parking = q->park(20ms, [&] { trail.add("timeout"); }); });
+  q->async([&] { trail.add("behind"); });
+  ASSERT_TRUE(pool.drain(10s));  // the deadline passes within the drain
+  EXPECT_EQ(trail.steps(), (std::vector<std::string>{"timeout", "behind"}));
+  EXPECT_FALSE(parking->resume([&] { trail.add("late"); }));
+
+  auto token = std::make_shared<int>(0);
+  std::weak_ptr<int> watch = token;
+  Countdown parkedAgain(1);
+  q->async([&, t = std::move(token)]() mutable {
+    parking = q->park(std::chrono::hours(1), [&trail, t] { trail.add("timeout 2"); });
+    t.reset();
+    parkedAgain.arrive();
+  });
+  q->async([&] { trail.add("behind 2"); });
+  ASSERT_TRUE(parkedAgain.wait());
+  EXPECT_FALSE(watch.expired());
+  EXPECT_TRUE(parking->resume([&] { trail.add("resumed"); }));
+  EXPECT_TRUE(watch.expired());
+  ASSERT_TRUE(pool.drain(10s));  // the spent deadline is not waited for
+
+  // Resumed before the parking closure returns, the queue never stops. One park at a time.
+  q->async([&] {
+    auto first = q->park(std::chrono::hours(1), nullptr);
+    EXPECT_FALSE(q->park(std::chrono::hours(1), nullptr)->resume(nullptr));
+    EXPECT_TRUE(first->resume([&] { trail.add("next"); }));
+    trail.add("returns");
+  });
+  q->async([&] { trail.add("behind 3"); });
+  ASSERT_TRUE(pool.drain(10s));
+  EXPECT_EQ(trail.steps(), (std::vector<std::string>{"timeout", "behind", "resumed", "behind 2", "returns", "next",
+                                                     "behind 3"}));
+}
+
+// drain waits for a parked queue only within its budget, and runs what waited behind
+// it when the resume comes in time. shutdown never waits for a park: it lets go of
+// the timeout closure and of the closures behind it, and later resumes are refused.
+TEST(Park, DrainWithinItsBudgetAndShutdownDropsParkedQueues) {
+  auto pool = std::make_unique<ThreadPoolDispatcher>(small(2));
+  auto q = pool->makeSerialQueue("parked", QoS::Utility);
+  Trail trail;
+  std::shared_ptr<Parking> parking;
+  Countdown parked(1);
+  q->async([&] {
+    parking = q->park(std::chrono::hours(1), [&] { trail.add("timeout"); });
+    parked.arrive();
+  });
+  q->async([&] { trail.add("behind"); });
+  ASSERT_TRUE(parked.wait());
+  EXPECT_FALSE(pool->drain(50ms));
+  std::thread late([&] {
+    std::this_thread::sleep_for(20ms);
+    parking->resume(nullptr);
+  });
+  EXPECT_TRUE(pool->drain(10s));
+  late.join();
+  EXPECT_EQ(trail.steps(), std::vector<std::string>{"behind"});
+
+  auto token = std::make_shared<int>(0);
+  std::weak_ptr<int> watch = token;
+  Countdown parkedAgain(1);
+  q->async([&, t = token] {
+    parking = q->park(std::chrono::hours(1), [&trail, t] { trail.add("timeout 2"); });
+    parkedAgain.arrive();
+  });
+  q->async([&trail, t = std::move(token)] { trail.add("behind 2"); });
+  ASSERT_TRUE(parkedAgain.wait());
+  auto stopped = std::async(std::launch::async, [&] { pool->shutdown(); });
+  ASSERT_EQ(stopped.wait_for(10s), std::future_status::ready);
+  EXPECT_TRUE(watch.expired());
+  EXPECT_FALSE(parking->resume([&] { trail.add("after shutdown"); }));
+  EXPECT_FALSE(q->park(1ms, [&] { trail.add("park after shutdown"); })->resume(nullptr));
+  EXPECT_TRUE(pool->drain(0ms));
+  pool.reset();
+  EXPECT_EQ(trail.steps(), std::vector<std::string>{"behind"});
 }
 
 // Delayed tasks, submitted out of order, run no earlier than their delay and

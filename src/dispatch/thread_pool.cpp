@@ -6,7 +6,6 @@
 #include <condition_variable>
 #include <cstdint>
 #include <deque>
-#include <list>
 #include <mutex>
 #include <system_error>
 #include <thread>
@@ -38,6 +37,7 @@ using SteadyTime = std::chrono::steady_clock::time_point;
 }  // namespace
 
 class PoolQueue;
+class PoolParking;
 
 class ThreadPoolDispatcher::Core {
  public:
@@ -61,6 +61,8 @@ class ThreadPoolDispatcher::Core {
   // One closure on its own, free to run beside any other.
   void submitTask(Task task, QoS qos);
   void submitDelayed(std::chrono::nanoseconds delay, Task task);
+  // Puts a park's deadline on the timer. False once the timer has stopped.
+  bool armDeadline(std::chrono::nanoseconds timeout, std::shared_ptr<PoolParking> parking);
 
  private:
   // A serial queue with work, or a lone closure of the concurrent queue.
@@ -69,57 +71,38 @@ class ThreadPoolDispatcher::Core {
     Task task;
   };
 
-  class Worker final : public BlockingRegion::Observer {
-   public:
-    explicit Worker(Core* core) : core_(core) {}
-    void blockingBegan() override {
-      if (depth_++ == 0) core_->blockingBegan();
-    }
-    void blockingEnded() override {
-      if (--depth_ == 0) core_->blockingEnded();
-    }
-    std::thread thread;
-    bool finished = false;  // guarded by Core::mu_
-
-   private:
-    Core* core_;
-    int depth_ = 0;  // touched only by the worker's own thread
-  };
-
+  // A delayed closure, or the deadline of a park (whose entry stays until due even
+  // when the park ends earlier: it then only holds the spent park).
   struct Delayed {
     SteadyTime due;
     std::uint64_t sequence;
     Task task;
+    std::shared_ptr<PoolParking> parking;
   };
   static bool laterThan(const Delayed& a, const Delayed& b) {
     return a.due != b.due ? a.due > b.due : a.sequence > b.sequence;
   }
 
-  void workerMain(Worker* self);
+  void workerMain();
   void timerMain();
-  void blockingBegan();
-  void blockingEnded();
+  bool startTimerLocked();
   bool popReadyLocked(Ready& out);
   bool hasReadyLocked() const;
   bool shouldWakeLocked(bool hadReady) const;
-  // Starts one worker; false when the thread could not be made.
-  bool spawnLocked();
-  std::vector<std::unique_ptr<Worker>> takeFinishedLocked();
   bool onWorkerThread() const;
 
   const Options options_;
   std::atomic<bool> stopping_{false};
-  // Closures submitted and due but not yet finished; drain waits for zero.
+  // Closures submitted and due, plus pending parks, not yet finished; drain waits for zero.
   std::atomic<std::size_t> pending_{0};
 
-  // mu_ guards ready_, workers_, threads_ and blocked_ (and orders drainCv_ wakeups).
+  // mu_ guards ready_, workers_ and threads_ (and orders drainCv_ wakeups).
   mutable std::mutex mu_;
   std::condition_variable workCv_;
   std::condition_variable drainCv_;
   std::array<std::deque<Ready>, kClassCount> ready_;
-  std::list<std::unique_ptr<Worker>> workers_;
+  std::vector<std::thread> workers_;
   std::size_t threads_ = 0;  // workers alive
-  std::size_t blocked_ = 0;  // workers inside a blocking region
 
   // timerMu_ guards delayed_ (a min-heap by due time), sequence_, timer_ and timerStop_.
   std::mutex timerMu_;
@@ -130,8 +113,31 @@ class ThreadPoolDispatcher::Core {
   bool timerStop_ = false;
 };
 
-// A serial queue: its own FIFO and a flag telling whether it sits in (or is being
-// run from) the pool's ready lists. Costs no thread.
+// One park of one queue. It holds the queue (and the timeout closure) until it ends,
+// exactly once: resumed, timed out, or dropped at shutdown.
+class PoolParking final : public Parking {
+ public:
+  // A park that never took effect: already spent.
+  PoolParking() = default;
+  PoolParking(std::shared_ptr<PoolQueue> queue, Task onTimeout)
+      : queue_(std::move(queue)), onTimeout_(std::move(onTimeout)) {}
+
+  bool resume(Task next) override { return end(std::move(next), false); }
+  // The deadline passed.
+  void expire() { end(nullptr, true); }
+  // Shutdown: the queue's waiting closures are released unrun.
+  void drop();
+
+ private:
+  bool end(Task next, bool timedOut);
+
+  std::mutex mu_;  // guards queue_ and onTimeout_; queue_ is empty once the park has ended
+  std::shared_ptr<PoolQueue> queue_;
+  Task onTimeout_;
+};
+
+// A serial queue: its own FIFO, a flag telling whether it sits in (or is being run
+// from) the pool's ready lists, and its pending park. Costs no thread, parked or not.
 class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<PoolQueue> {
  public:
   PoolQueue(std::shared_ptr<ThreadPoolDispatcher::Core> core, std::string label, QoS qos)
@@ -144,8 +150,8 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
     {
       std::lock_guard lock(mu_);
       fifo_.push_back(std::move(task));
-      schedule = !scheduled_;
-      scheduled_ = true;
+      schedule = !scheduled_ && !park_;
+      if (schedule) scheduled_ = true;
     }
     if (schedule) core_->submitQueue(shared_from_this(), qos_);
   }
@@ -153,15 +159,37 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
   const std::string& label() const override { return label_; }
   QoS qos() const { return qos_; }
 
+  std::shared_ptr<Parking> park(std::chrono::nanoseconds timeout, Task onTimeout) override {
+    if (core_->stopping()) return std::make_shared<PoolParking>();
+    auto parking = std::make_shared<PoolParking>(shared_from_this(), std::move(onTimeout));
+    // The park counts as due work from now on, so drain waits for its end; the
+    // closure it ends with takes the count over.
+    core_->taskAdded();
+    bool refused;
+    {
+      std::lock_guard lock(mu_);
+      refused = park_ != nullptr;
+      if (!refused) park_ = parking;
+    }
+    if (refused) {
+      core_->taskFinished();
+      parking = nullptr;  // releases onTimeout outside the lock
+      return std::make_shared<PoolParking>();
+    }
+    if (!core_->armDeadline(timeout, parking)) parking->drop();
+    return parking;
+  }
+
   // Runs up to batch closures in order; true when more remain and the queue stays
-  // scheduled (the caller puts it back in line).
+  // scheduled (the caller puts it back in line). A park stops the batch between
+  // closures and leaves the queue out of line until the park ends.
   bool runBatch(std::size_t batch) {
     for (std::size_t i = 0; i < batch && !core_->stopping(); ++i) {
       {
         Task task;
         {
           std::lock_guard lock(mu_);
-          if (fifo_.empty()) {
+          if (fifo_.empty() || park_) {
             scheduled_ = false;
             return false;
           }
@@ -173,8 +201,40 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
       core_->taskFinished();
     }
     std::lock_guard lock(mu_);
-    if (fifo_.empty()) scheduled_ = false;
+    if (fifo_.empty() || park_) scheduled_ = false;
     return scheduled_;
+  }
+
+  // The winner of the park's end: first (when not empty) goes to the head of the line.
+  void unpark(const PoolParking* which, Task first) {
+    std::shared_ptr<Parking> ended;  // released outside the lock
+    bool schedule = false, counted = false;
+    {
+      std::lock_guard lock(mu_);
+      if (park_.get() == which) ended = std::move(park_);
+      if (first) {
+        fifo_.push_front(std::move(first));
+        counted = true;
+      }
+      schedule = !scheduled_ && !park_ && !fifo_.empty();
+      if (schedule) scheduled_ = true;
+    }
+    if (!counted) core_->taskFinished();
+    if (schedule) core_->submitQueue(shared_from_this(), qos_);
+  }
+
+  // Shutdown: a parked queue lets go of its park and of what waits behind it.
+  void dropParked(const PoolParking* which) {
+    std::shared_ptr<Parking> ended;
+    std::deque<Task> dropped;
+    {
+      std::lock_guard lock(mu_);
+      if (park_.get() == which) ended = std::move(park_);
+      dropped.swap(fifo_);
+    }
+    auto count = dropped.size() + 1;  // and the park itself
+    dropped.clear();
+    for (std::size_t i = 0; i < count; ++i) core_->taskFinished();
   }
 
   // After shutdown: drops what is queued.
@@ -194,10 +254,37 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
   const std::shared_ptr<ThreadPoolDispatcher::Core> core_;
   const std::string label_;
   const QoS qos_;
-  std::mutex mu_;  // guards fifo_ and scheduled_
+  std::mutex mu_;  // guards fifo_, scheduled_ and park_
   std::deque<Task> fifo_;
   bool scheduled_ = false;
+  std::shared_ptr<PoolParking> park_;  // pending park; the queue runs nothing while set
 };
+
+bool PoolParking::end(Task next, bool timedOut) {
+  std::shared_ptr<PoolQueue> queue;
+  Task onTimeout;  // released here when resumed: its captures go as soon as the wait ends
+  {
+    std::lock_guard lock(mu_);
+    queue = std::move(queue_);
+    onTimeout = std::move(onTimeout_);
+    onTimeout_ = nullptr;
+  }
+  if (!queue) return false;  // next is released unrun
+  queue->unpark(this, timedOut ? std::move(onTimeout) : std::move(next));
+  return true;
+}
+
+void PoolParking::drop() {
+  std::shared_ptr<PoolQueue> queue;
+  Task onTimeout;
+  {
+    std::lock_guard lock(mu_);
+    queue = std::move(queue_);
+    onTimeout = std::move(onTimeout_);
+    onTimeout_ = nullptr;
+  }
+  if (queue) queue->dropParked(this);
+}
 
 namespace {
 // The pool whose worker this thread is; null elsewhere.
@@ -205,7 +292,7 @@ thread_local const ThreadPoolDispatcher::Core* tlsCurrentCore = nullptr;
 }  // namespace
 
 ThreadPoolDispatcher::Core::Core(Options options) : options_([&] {
-  if (options.coreWorkers == 0) options.coreWorkers = std::max(2u, std::thread::hardware_concurrency());
+  if (options.workers == 0) options.workers = std::clamp(std::thread::hardware_concurrency(), 2u, 4u);
   if (options.batchSize == 0) options.batchSize = 1;
   return options;
 }()) {}
@@ -214,33 +301,14 @@ ThreadPoolDispatcher::Core::~Core() { shutdown(); }
 
 void ThreadPoolDispatcher::Core::start() {
   std::lock_guard lock(mu_);
-  for (std::size_t i = 0; i < options_.coreWorkers; ++i) spawnLocked();
-}
-
-bool ThreadPoolDispatcher::Core::spawnLocked() {
-  auto worker = std::make_unique<Worker>(this);
-  Worker* raw = worker.get();
-  try {
-    worker->thread = std::thread([this, raw] { workerMain(raw); });
-  } catch (const std::system_error&) {
-    return false;
-  }
-  workers_.push_back(std::move(worker));
-  ++threads_;
-  return true;
-}
-
-std::vector<std::unique_ptr<ThreadPoolDispatcher::Core::Worker>> ThreadPoolDispatcher::Core::takeFinishedLocked() {
-  std::vector<std::unique_ptr<Worker>> done;
-  for (auto it = workers_.begin(); it != workers_.end();) {
-    if ((*it)->finished) {
-      done.push_back(std::move(*it));
-      it = workers_.erase(it);
-    } else {
-      ++it;
+  for (std::size_t i = 0; i < options_.workers; ++i) {
+    try {
+      workers_.emplace_back([this] { workerMain(); });
+      ++threads_;
+    } catch (const std::system_error&) {
+      break;  // the workers that could be made carry the load
     }
   }
-  return done;
 }
 
 bool ThreadPoolDispatcher::Core::onWorkerThread() const { return tlsCurrentCore == this; }
@@ -260,9 +328,8 @@ bool ThreadPoolDispatcher::Core::popReadyLocked(Ready& out) {
   return false;
 }
 
-void ThreadPoolDispatcher::Core::workerMain(Worker* self) {
+void ThreadPoolDispatcher::Core::workerMain() {
   tlsCurrentCore = this;
-  BlockingRegion::setThreadObserver(self);
   std::unique_lock lock(mu_);
   while (!stopping()) {
     Ready item;
@@ -285,38 +352,11 @@ void ThreadPoolDispatcher::Core::workerMain(Worker* self) {
       lock.lock();
       continue;
     }
-    bool woken = workCv_.wait_for(lock, options_.extraIdleTimeout, [&] { return stopping() || hasReadyLocked(); });
-    // A worker that found nothing to do for a while leaves if enough others remain.
-    if (!woken && threads_ - blocked_ > options_.coreWorkers) break;
+    workCv_.wait(lock, [&] { return stopping() || hasReadyLocked(); });
   }
-  self->finished = true;
   --threads_;
   lock.unlock();
-  BlockingRegion::setThreadObserver(nullptr);
   tlsCurrentCore = nullptr;
-}
-
-void ThreadPoolDispatcher::Core::blockingBegan() {
-  std::vector<std::unique_ptr<Worker>> finished;
-  {
-    std::lock_guard lock(mu_);
-    ++blocked_;
-    if (stopping()) return;
-    // Keep the core number of workers free to run queues, within the cap.
-    if (threads_ - blocked_ < options_.coreWorkers && threads_ < options_.coreWorkers + options_.maxExtraWorkers) {
-      finished = takeFinishedLocked();
-      spawnLocked();
-    } else if (hasReadyLocked()) {
-      // This worker submitted without waking anyone; an idle worker takes over.
-      workCv_.notify_one();
-    }
-  }
-  for (auto& w : finished) w->thread.join();
-}
-
-void ThreadPoolDispatcher::Core::blockingEnded() {
-  std::lock_guard lock(mu_);
-  --blocked_;
 }
 
 void ThreadPoolDispatcher::Core::taskFinished() {
@@ -329,8 +369,8 @@ void ThreadPoolDispatcher::Core::taskFinished() {
 bool ThreadPoolDispatcher::Core::shouldWakeLocked(bool hadReady) const {
   // A worker that submits picks the item up itself once its closure returns, so
   // waking another thread only pays when there is already a backlog. This turns a
-  // pipeline of small closures into batches instead of thread ping-pong. A worker
-  // that goes on to block hands its backlog over in blockingBegan().
+  // pipeline of small closures into batches instead of thread ping-pong; closures
+  // never block for long (waits park their queue), so the item is not held up.
   return !onWorkerThread() || hadReady;
 }
 
@@ -371,6 +411,16 @@ void ThreadPoolDispatcher::Core::submitTask(Task task, QoS qos) {
   if (wake) workCv_.notify_one();
 }
 
+bool ThreadPoolDispatcher::Core::startTimerLocked() {
+  if (timer_.joinable()) return true;
+  try {
+    timer_ = std::thread([this] { timerMain(); });
+  } catch (const std::system_error&) {
+    return false;
+  }
+  return true;
+}
+
 void ThreadPoolDispatcher::Core::submitDelayed(std::chrono::nanoseconds delay, Task task) {
   if (!task || stopping()) return;
   if (delay <= std::chrono::nanoseconds::zero()) {
@@ -379,18 +429,32 @@ void ThreadPoolDispatcher::Core::submitDelayed(std::chrono::nanoseconds delay, T
   }
   auto due = std::chrono::steady_clock::now() + std::chrono::duration_cast<std::chrono::steady_clock::duration>(delay);
   std::lock_guard lock(timerMu_);
-  if (timerStop_) return;
-  if (!timer_.joinable()) {
-    try {
-      timer_ = std::thread([this] { timerMain(); });
-    } catch (const std::system_error&) {
-      return;
-    }
-  }
+  if (timerStop_ || !startTimerLocked()) return;
   bool earliest = delayed_.empty() || due < delayed_.front().due;
-  delayed_.push_back(Delayed{due, sequence_++, std::move(task)});
+  delayed_.push_back(Delayed{due, sequence_++, std::move(task), nullptr});
   std::push_heap(delayed_.begin(), delayed_.end(), laterThan);
   if (earliest) timerCv_.notify_one();
+}
+
+bool ThreadPoolDispatcher::Core::armDeadline(std::chrono::nanoseconds timeout, std::shared_ptr<PoolParking> parking) {
+  auto due = std::chrono::steady_clock::now() +
+             std::chrono::duration_cast<std::chrono::steady_clock::duration>(std::max(timeout, std::chrono::nanoseconds::zero()));
+  bool noTimer = false;
+  {
+    std::lock_guard lock(timerMu_);
+    if (timerStop_) return false;
+    if (startTimerLocked()) {
+      bool earliest = delayed_.empty() || due < delayed_.front().due;
+      delayed_.push_back(Delayed{due, sequence_++, nullptr, parking});
+      std::push_heap(delayed_.begin(), delayed_.end(), laterThan);
+      if (earliest) timerCv_.notify_one();
+    } else {
+      noTimer = true;
+    }
+  }
+  // Without a timer thread no deadline could ever pass: it passes now.
+  if (noTimer) parking->expire();
+  return true;
 }
 
 void ThreadPoolDispatcher::Core::timerMain() {
@@ -407,10 +471,15 @@ void ThreadPoolDispatcher::Core::timerMain() {
       continue;
     }
     std::pop_heap(delayed_.begin(), delayed_.end(), laterThan);
-    Task task = std::move(delayed_.back().task);
+    Delayed entry = std::move(delayed_.back());
     delayed_.pop_back();
     lock.unlock();
-    submitTask(std::move(task), kLowPriorityClass);
+    if (entry.parking) {
+      entry.parking->expire();  // a no-op when the park has already ended
+    } else {
+      submitTask(std::move(entry.task), kLowPriorityClass);
+    }
+    entry = Delayed{};
     lock.lock();
   }
 }
@@ -432,7 +501,7 @@ void ThreadPoolDispatcher::Core::shutdown() {
     workCv_.notify_all();
     return;
   }
-  std::list<std::unique_ptr<Worker>> workers;
+  std::vector<std::thread> workers;
   {
     std::lock_guard lock(mu_);
     stopping_.store(true, std::memory_order_release);
@@ -448,8 +517,12 @@ void ThreadPoolDispatcher::Core::shutdown() {
     delayed.swap(delayed_);
   }
   timerCv_.notify_all();
-  for (auto& w : workers) w->thread.join();
+  for (auto& w : workers) w.join();
   if (timer.joinable()) timer.join();
+  // Every pending park has its deadline here, so none is left behind. Dropped
+  // outside the locks: a closure's captures may submit again while dying.
+  for (auto& entry : delayed)
+    if (entry.parking) entry.parking->drop();
   delayed.clear();
 
   std::array<std::deque<Ready>, kClassCount> left;
@@ -457,7 +530,6 @@ void ThreadPoolDispatcher::Core::shutdown() {
     std::lock_guard lock(mu_);
     left.swap(ready_);
   }
-  // Dropped outside the lock: a closure's captures may submit again while dying.
   for (auto& list : left) {
     for (auto& item : list) {
       if (item.queue) {

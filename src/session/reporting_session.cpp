@@ -19,13 +19,6 @@ constexpr const char* kClientName = "com.orvane.vireo";
 constexpr std::int64_t kClientType = 19;
 constexpr double kClientVersion = 2.0;
 
-// What the backend closure and the telemetry service's completion share; it lives
-// as long as either still holds it.
-struct BackendDiscovery {
-  ReportingCondition condition;
-  bool found = false;  // guarded by condition.lock
-};
-
 }  // namespace
 
 std::shared_ptr<VRReportingSession> VRReportingSession::initWithID(std::shared_ptr<ReportingEnvironment> env,
@@ -303,8 +296,8 @@ void VRReportingSession::startBackendSession(const Dictionary& userInfo, const s
     return;
   }
 
-  auto discovery = std::make_shared<BackendDiscovery>();
-  discovery->found = backendFound;
+  // Shared by the wait and the telemetry service's completion; lives as long as either holds it.
+  auto discovery = std::make_shared<ReportingCondition>(backendFound);
   telemetry->startConfiguration([discovery, env = env_](std::optional<std::vector<std::string>> backends) {
     static constexpr const char* kLabel = "-[VRReportingSession start]_block_invoke_2";
     if (!backends) {
@@ -316,20 +309,21 @@ void VRReportingSession::startBackendSession(const Dictionary& userInfo, const s
     for (auto& name : *backends) list.emplace_back(name);
     VR_LOG(env->logger(), LogScope::Session, LogLevel::Default, kLabel, "List of backends %s",
            Value(std::move(list)).text().c_str());
-    discovery->condition.signalDone(&discovery->found);
+    discovery->signalDone();
   });
 
-  const bool ready = VRReportingUtilityWait(discovery->condition, &discovery->found,
-                                            "waiting for skylarkreportingd to find backends",
-                                            "failed to find backend", env_->logger(), LogScope::Session,
-                                            env_->backendWaitInterval.load());
-  if (!ready) {
-    {
-      std::lock_guard<std::mutex> guard(fieldsLock_);
-      skylarkReportingSession_.reset();
-    }
-    skylarkReportingSessionStarted_ = false;
-  }
+  // The queue stays parked, holding no thread, until the wait ends; what was
+  // submitted behind this closure runs after the outcome below.
+  VRReportingUtilityWaitAsync(skylarkReportingQueue_, discovery, "waiting for skylarkreportingd to find backends",
+                              "failed to find backend", env_->logger(), LogScope::Session,
+                              env_->backendWaitInterval.load(), [self = shared_from_this()](bool ready) {
+                                if (ready) return;
+                                {
+                                  std::lock_guard<std::mutex> guard(self->fieldsLock_);
+                                  self->skylarkReportingSession_.reset();
+                                }
+                                self->skylarkReportingSessionStarted_ = false;
+                              });
 }
 
 // ---------------------------------------------------------------- single messages

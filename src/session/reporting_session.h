@@ -106,7 +106,8 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
  private:
   VRReportingSession(std::shared_ptr<ReportingEnvironment> env, std::int64_t reporterID,
                      std::vector<std::int32_t> processIdentifiers);
-  // The backend-session closure run on skylarkReportingQueue after start.
+  // The backend-session closure run on skylarkReportingQueue after start. It leaves
+  // the queue parked while the telemetry service looks for backends.
   void startBackendSession(const Dictionary& userInfo, const std::string& serviceName, bool backendFound);
   // The orientation handlers registered at start; mode is "device" or "ui".
   void registerOrientationHandlers();

@@ -82,6 +82,8 @@ TEST_F(SessionTest, NewSessionRecordTypeConfigurationAndDestruction) {
 
 // Before start and after stop a message goes out on its own, without the session's user info.
 TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
+  // The backends come from the service's own thread, while the queue may be parked.
+  p.telemetry.setBehaviour({BackendAnswer::List, true, false});
   auto s = make(2);
   Dictionary config{{"HostApplicationDisplayID", "x"}};
   s->setConfiguration(&config);
@@ -99,6 +101,8 @@ TEST_F(SessionTest, MessagesWaitForTheBackendThenSummaryThenFlush) {
   s->sendMessage(Dictionary{{"n", 1}}, 0x40000003, 1, [&](bool v) { reply = v; });
   EXPECT_EQ(reply, false);
   s->sendMessage(Dictionary{{"n", 2}}, 0x40000003, 2, true, nullptr);
+  p.dispatcher.runAll();
+  ASSERT_TRUE(p.dispatcher.awaitUnparked());
   p.dispatcher.runAll();
 
   auto created = p.telemetry.created();
@@ -169,13 +173,17 @@ TEST_F(SessionTest, PayloadKeyCleaning) {
   EXPECT_EQ(cleanPayloadKeys(Dictionary{{"a b", 1}, {"a_b", 2}}), (Dictionary{{"a_b", 2}}));
 }
 
+// Without an answer the queue stays parked for the whole interval, holding the
+// message behind it; then the wait gives up, the telemetry session goes and the
+// message is dropped, in that order.
 TEST_F(SessionTest, BackendAnswers) {
+  using namespace std::chrono_literals;
   struct Case { BackendAnswer answer; bool ownThread; double wait; bool kept; const char* line; };
   for (Case c : {Case{BackendAnswer::EmptyList, false, 0.01, true, "List of backends"},
                  Case{BackendAnswer::List, true, 30.0, true, "List of backends"},
-                 Case{BackendAnswer::Nothing, false, 0.01, false,
+                 Case{BackendAnswer::Nothing, false, 9.0, false,
                       "No backends found, this session won't get sent to the server"},
-                 Case{BackendAnswer::Never, false, 0.01, false, nullptr}}) {
+                 Case{BackendAnswer::Never, false, 9.0, false, nullptr}}) {
     SCOPED_TRACE(static_cast<int>(c.answer));
     p.logger.clear();
     p.telemetry.setBehaviour({c.answer, c.ownThread, false});
@@ -183,6 +191,20 @@ TEST_F(SessionTest, BackendAnswers) {
     auto s = make();
     s->start();
     s->sendMessage(Dictionary{{"n", 1}}, 3, 1, nullptr);
+    p.dispatcher.runAll();
+    if (c.ownThread) {
+      ASSERT_TRUE(p.dispatcher.awaitUnparked());
+    } else if (!c.kept) {
+      auto queue = p.dispatcher.queue("com.orvane.vireo.session.skylarkreporting");
+      EXPECT_EQ(queue->parkTimeouts().back(), 9s);
+      EXPECT_EQ(p.dispatcher.parkedCount(), 1u);
+      EXPECT_FALSE(p.logger.contains("failed to find backend"));
+      EXPECT_FALSE(p.logger.contains("No valid SkylarkReportingSession"));
+      EXPECT_EQ(p.dispatcher.advance(8999ms), 0u);
+      p.dispatcher.runAll();
+      EXPECT_FALSE(p.logger.contains("failed to find backend"));
+      EXPECT_EQ(p.dispatcher.advance(1ms), 1u);
+    }
     p.dispatcher.runAll();
     EXPECT_EQ(c.line ? p.logger.count(c.line) : 1u, 1u);
     EXPECT_EQ(s->skylarkReportingSession() != nullptr, c.kept);
@@ -193,6 +215,16 @@ TEST_F(SessionTest, BackendAnswers) {
     auto dropped = p.logger.matching("No valid SkylarkReportingSession");
     ASSERT_EQ(dropped.size(), c.kept ? 0u : 1u);
     EXPECT_TRUE(c.kept || dropped[0].level == LogLevel::Error);
+    if (!c.kept) {
+      std::vector<std::pair<LogLevel, std::string>> wait;
+      for (auto& e : p.logger.entries())
+        if (e.function == "VRReportingUtilityWait" || e.message == "No valid SkylarkReportingSession")
+          wait.emplace_back(e.level, e.message);
+      EXPECT_EQ(wait, (std::vector<std::pair<LogLevel, std::string>>{
+                          {LogLevel::Default, "waiting for skylarkreportingd to find backends"},
+                          {LogLevel::Error, "failed to find backend"},
+                          {LogLevel::Error, "No valid SkylarkReportingSession"}}));
+    }
     EXPECT_FALSE(s->skylarkReportingSessionStarted());
     s->stop();
     p.dispatcher.runAll();

@@ -1,9 +1,9 @@
 #include "vocabulary/reporting_utility.h"
 
+#include <algorithm>
 #include <chrono>
 #include <string>
 
-#include "dispatch/dispatch.h"
 #include "vocabulary/reporting_environment.h"
 
 namespace vireo {
@@ -70,27 +70,107 @@ Value VRReportingHostApplicationDisplayID(const Dictionary* userInfo) {
 
 bool VRReportingIsInternalBuild(ReportingEnvironment& env) { return env.isInternalBuild(); }
 
-bool VRReportingUtilityWait(ReportingCondition& condition, bool* done, std::string_view waitMessage,
-                            std::string_view giveUpMessage, Logger& logger, std::optional<LogScope> scope,
-                            double interval) {
-  const LogScope where = scope.value_or(LogScope::DefaultLog);
-  const std::string waitText(waitMessage);
-  const std::string giveUpText(giveUpMessage);
-  const auto span = std::chrono::duration_cast<std::chrono::steady_clock::duration>(
-      std::chrono::duration<double>(interval > 0 ? interval : 0));
+// One wait in progress. While its queue is parked the park's timeout closure holds
+// it; a wake-up closure holds it once resumed; the condition only points at it.
+class ReportingWaiter : public std::enable_shared_from_this<ReportingWaiter> {
+ public:
+  ReportingWaiter(std::shared_ptr<SerialQueue> queue, std::shared_ptr<ReportingCondition> condition,
+                  std::string_view waitMessage, std::string_view giveUpMessage, Logger& logger, LogScope where,
+                  double interval, std::function<void(bool)> onDone)
+      : queue_(std::move(queue)),
+        condition_(std::move(condition)),
+        logger_(logger),
+        where_(where),
+        waitText_(waitMessage),
+        giveUpText_(giveUpMessage),
+        // Beyond a billion seconds nobody is waiting any more; it also keeps the cast defined.
+        span_(std::chrono::duration_cast<std::chrono::nanoseconds>(
+            std::chrono::duration<double>(interval > 0 ? std::min(interval, 1e9) : 0))),
+        onDone_(std::move(onDone)) {}
 
-  std::unique_lock<std::mutex> lock(condition.lock);
-  if (*done) return true;
-  BlockingRegion blocking;
-  for (;;) {
-    VR_LOG(logger, where, LogLevel::Default, "VRReportingUtilityWait", "%s", waitText.c_str());
-    if (condition.condition.wait_until(lock, std::chrono::steady_clock::now() + span) == std::cv_status::timeout) {
-      VR_LOG(logger, where, LogLevel::Error, "VRReportingUtilityWait", "%s", giveUpText.c_str());
-      return false;
+  void begin() {
+    {
+      std::lock_guard<std::mutex> lock(condition_->lock_);
+      if (!condition_->done_) return parkLocked();
     }
-    VR_LOG(logger, where, LogLevel::Default, "VRReportingUtilityWait", "continuing");
-    if (*done) return true;
+    finish(true);
   }
+
+  // On the queue, after a signal. Under the condition's lock from the check to the
+  // next park, so no signal falls in between.
+  void woken() {
+    {
+      std::lock_guard<std::mutex> lock(condition_->lock_);
+      VR_LOG(logger_, where_, LogLevel::Default, kLabel, "continuing");
+      if (!condition_->done_) return parkLocked();
+      condition_->waiter_.reset();
+    }
+    finish(true);
+  }
+
+  // On the queue, after an interval of silence: a signal that comes now is too late.
+  void timedOut() {
+    std::shared_ptr<Parking> spent;
+    {
+      std::lock_guard<std::mutex> lock(condition_->lock_);
+      condition_->waiter_.reset();
+      spent = std::move(condition_->parking_);
+      VR_LOG(logger_, where_, LogLevel::Error, kLabel, "%s", giveUpText_.c_str());
+    }
+    finish(false);
+  }
+
+ private:
+  static constexpr const char* kLabel = "VRReportingUtilityWait";
+
+  // With condition_->lock_ held: one round of waiting.
+  void parkLocked() {
+    VR_LOG(logger_, where_, LogLevel::Default, kLabel, "%s", waitText_.c_str());
+    condition_->waiter_ = weak_from_this();
+    condition_->parking_ = queue_->park(span_, [self = shared_from_this()] { self->timedOut(); });
+  }
+
+  void finish(bool done) {
+    auto onDone = std::move(onDone_);
+    onDone_ = nullptr;
+    if (onDone) onDone(done);
+  }
+
+  const std::shared_ptr<SerialQueue> queue_;
+  const std::shared_ptr<ReportingCondition> condition_;
+  Logger& logger_;
+  const LogScope where_;
+  const std::string waitText_;
+  const std::string giveUpText_;
+  const std::chrono::nanoseconds span_;
+  std::function<void(bool)> onDone_;  // touched only on queue_
+};
+
+bool ReportingCondition::done() const {
+  std::lock_guard<std::mutex> lock(lock_);
+  return done_;
+}
+
+void ReportingCondition::wake(bool setDone) {
+  std::shared_ptr<ReportingWaiter> waiter;
+  std::shared_ptr<Parking> parking;
+  {
+    std::lock_guard<std::mutex> lock(lock_);
+    if (setDone) done_ = true;
+    waiter = waiter_.lock();
+    parking = std::move(parking_);  // one wake-up per round
+  }
+  // Loses to a deadline that has already passed: the waiter then gives up.
+  if (waiter && parking) parking->resume([waiter] { waiter->woken(); });
+}
+
+void VRReportingUtilityWaitAsync(std::shared_ptr<SerialQueue> queue, std::shared_ptr<ReportingCondition> condition,
+                                 std::string_view waitMessage, std::string_view giveUpMessage, Logger& logger,
+                                 std::optional<LogScope> scope, double interval, std::function<void(bool)> onDone) {
+  auto waiter = std::make_shared<ReportingWaiter>(std::move(queue), std::move(condition), waitMessage, giveUpMessage,
+                                                  logger, scope.value_or(LogScope::DefaultLog), interval,
+                                                  std::move(onDone));
+  waiter->begin();
 }
 
 }  // namespace vireo

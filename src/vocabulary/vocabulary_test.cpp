@@ -3,14 +3,17 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <mutex>
 #include <thread>
 
+#include "dispatch/thread_pool.h"
 #include "fakes/fake_platform.h"
 
 namespace vireo {
 namespace {
 
 using testing::FakePlatform;
+using namespace std::chrono_literals;
 
 TEST(VocabularyLabels, CategoryTypeAndServiceTables) {
   // Unrecognised areas keep a bare separator; combined area bits are not recognised.
@@ -52,53 +55,124 @@ TEST(VocabularyLabels, InternalBuildIsComputedOnce) {
   EXPECT_FALSE(VRReportingIsInternalBuild(*unanswered.env));
 }
 
-// Waits until the waiter has logged its wait line `times` times; the waiter holds
-// the lock while logging, so once the lock is ours again it is inside the wait.
-void awaitWaitLines(const testing::RecordingLogger& logger, std::size_t times) {
-  while (logger.count("waiting") < times) std::this_thread::sleep_for(std::chrono::milliseconds(1));
-}
+// The bounded wait on a queue run by hand, with manual time for its deadlines.
+class BoundedWait : public ::testing::Test {
+ protected:
+  // Starts a wait from a closure on the queue, with another closure queued behind it.
+  void start(std::shared_ptr<ReportingCondition> condition, double interval,
+             std::optional<LogScope> scope = LogScope::Session) {
+    queue->async([this, condition, interval, scope] {
+      VRReportingUtilityWaitAsync(queue, condition, "waiting", "gave up", p.logger, scope, interval,
+                                  [this](bool done) { events.push_back(done ? "done" : "failed"); });
+    });
+    queue->async([this] { events.push_back("behind"); });
+    p.dispatcher.runAll();
+  }
+  std::vector<std::string> lines() const {
+    std::vector<std::string> out;
+    for (auto& e : p.logger.entries()) out.push_back(e.message);
+    return out;
+  }
+  static std::chrono::nanoseconds seconds(double s) {
+    return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::duration<double>(s));
+  }
 
-TEST(BoundedWait, SetFlagReturnsAtOnceAndSilenceGivesUpAfterOneInterval) {
   FakePlatform p;
-  ReportingCondition cond;
-  bool done = true;
-  EXPECT_TRUE(VRReportingUtilityWait(cond, &done, "waiting", "gave up", p.logger, LogScope::Session, 30.0));
+  std::shared_ptr<SerialQueue> queue = p.dispatcher.makeSerialQueue("waiter", QoS::Utility);
+  std::vector<std::string> events;  // on the test's thread only
+};
+
+TEST_F(BoundedWait, SetFlagEndsAtOnceAndSilenceGivesUpAfterOneInterval) {
+  start(std::make_shared<ReportingCondition>(true), 30.0);
+  EXPECT_EQ(events, (std::vector<std::string>{"done", "behind"}));
   EXPECT_EQ(p.logger.size(), 0u);
+  EXPECT_EQ(p.dispatcher.parkedCount(), 0u);
 
-  done = false;
-  EXPECT_FALSE(VRReportingUtilityWait(cond, &done, "waiting", "gave up", p.logger, LogScope::Session, 0.02));
-  auto lines = p.logger.entries();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].message, "waiting");
-  EXPECT_EQ(lines[0].level, LogLevel::Default);
-  EXPECT_EQ(lines[0].function, "VRReportingUtilityWait");
-  EXPECT_EQ(lines[1].message, "gave up");
-  EXPECT_EQ(lines[1].level, LogLevel::Error);
-  EXPECT_EQ(lines[1].scope, LogScope::Session);
-  // The condition is left unlocked.
-  EXPECT_TRUE(cond.lock.try_lock());
-  cond.lock.unlock();
+  events.clear();
+  start(std::make_shared<ReportingCondition>(), 9.0);
+  EXPECT_EQ(lines(), std::vector<std::string>{"waiting"});
+  EXPECT_EQ(p.dispatcher.parkedCount(), 1u);  // the queue waits, the closure behind too
+  EXPECT_TRUE(events.empty());
+  EXPECT_EQ(p.dispatcher.advance(seconds(8.999)), 0u);
+  p.dispatcher.runAll();
+  EXPECT_TRUE(events.empty());
+  EXPECT_EQ(p.dispatcher.advance(seconds(0.001)), 1u);
+  p.dispatcher.runAll();
+  EXPECT_EQ(events, (std::vector<std::string>{"failed", "behind"}));
+  auto entries = p.logger.entries();
+  ASSERT_EQ(entries.size(), 2u);
+  EXPECT_EQ(entries[0].level, LogLevel::Default);
+  EXPECT_EQ(entries[0].function, "VRReportingUtilityWait");
+  EXPECT_EQ(entries[1].message, "gave up");
+  EXPECT_EQ(entries[1].level, LogLevel::Error);
+  EXPECT_EQ(entries[1].scope, LogScope::Session);
+
+  // A signal after the deadline passed, before the queue ran on: too late.
+  events.clear();
+  p.logger.clear();
+  auto late = std::make_shared<ReportingCondition>();
+  start(late, 9.0);
+  p.dispatcher.advance(seconds(9.0));
+  late->signalDone();
+  p.dispatcher.runAll();
+  EXPECT_EQ(lines(), (std::vector<std::string>{"waiting", "gave up"}));
+  EXPECT_EQ(events, (std::vector<std::string>{"failed", "behind"}));
+  EXPECT_TRUE(late->done());
 }
 
-TEST(BoundedWait, SignalWithoutFlagRestartsUntilFlagIsSet) {
+TEST_F(BoundedWait, EachSignalRestartsTheIntervalUntilTheFlagIsSet) {
+  auto condition = std::make_shared<ReportingCondition>();
+  condition->signal();  // nobody waits yet: lost
+  start(condition, 9.0, std::nullopt);
+  p.dispatcher.advance(seconds(6));
+  condition->signal();
+  p.dispatcher.runAll();
+  EXPECT_EQ(lines(), (std::vector<std::string>{"waiting", "continuing", "waiting"}));
+  EXPECT_EQ(p.dispatcher.advance(seconds(6)), 0u);  // 12 s since the start, 6 since the signal
+  condition->signalDone();
+  condition->signalDone();  // the second finds the wait already woken
+  p.dispatcher.runAll();
+  EXPECT_EQ(lines(), (std::vector<std::string>{"waiting", "continuing", "waiting", "continuing"}));
+  EXPECT_EQ(events, (std::vector<std::string>{"done", "behind"}));
+  for (auto& e : p.logger.entries()) EXPECT_EQ(e.scope, LogScope::DefaultLog);
+  // Over: neither signals nor the old deadlines do anything more.
+  condition->signal();
+  EXPECT_EQ(p.dispatcher.advance(std::chrono::hours(1)), 0u);
+  p.dispatcher.runAll();
+  EXPECT_EQ(p.logger.size(), 4u);
+}
+
+// On the real pool, signals from another thread and deadlines race the queues.
+TEST(BoundedWaitOnThePool, SignalledWaitsEndDoneAndSilentOnesGiveUp) {
+  constexpr int kWaits = 400;
   FakePlatform p;
-  ReportingCondition cond;
-  bool done = false;
-  std::thread signaller([&] {
-    awaitWaitLines(p.logger, 1);
-    {
-      std::lock_guard<std::mutex> guard(cond.lock);
-    }
-    cond.condition.notify_all();  // wakes without the flag
-    awaitWaitLines(p.logger, 2);
-    cond.signalDone(&done);
-  });
-  EXPECT_TRUE(VRReportingUtilityWait(cond, &done, "waiting", "gave up", p.logger, std::nullopt, 30.0));
-  signaller.join();
-  EXPECT_EQ(p.logger.count("waiting"), 2u);
-  EXPECT_EQ(p.logger.count("continuing"), 2u);
-  EXPECT_FALSE(p.logger.contains("gave up"));
-  EXPECT_EQ(p.logger.entries().front().scope, LogScope::DefaultLog);
+  ThreadPoolDispatcher pool;
+  std::mutex mu;  // guards outcomes
+  std::vector<std::string> outcomes(kWaits);
+  std::vector<std::shared_ptr<ReportingCondition>> conditions;
+  for (int i = 0; i < kWaits; ++i) {
+    auto q = pool.makeSerialQueue("waiter", QoS::Utility);
+    auto c = conditions.emplace_back(std::make_shared<ReportingCondition>());
+    auto record = [&, i](const char* what) {
+      std::lock_guard lock(mu);
+      outcomes[i] += what;
+    };
+    // The odd ones are signalled; the even ones hear nothing for 50 ms.
+    q->async([&p, q, c, record, interval = i % 2 ? 30.0 : 0.05] {
+      VRReportingUtilityWaitAsync(q, c, "waiting", "gave up", p.logger, LogScope::Session, interval,
+                                  [record](bool done) { record(done ? "done" : "failed"); });
+    });
+    q->async([record] { record(" behind"); });
+  }
+  // Each signalled wait must have begun, or the flag alone would end it.
+  for (auto until = std::chrono::steady_clock::now() + 30s;
+       p.logger.count("waiting") < kWaits && std::chrono::steady_clock::now() < until;)
+    std::this_thread::sleep_for(1ms);
+  for (int i = 1; i < kWaits; i += 2) conditions[i]->signalDone();  // from outside the pool
+  ASSERT_TRUE(pool.drain(30s));
+  std::lock_guard lock(mu);
+  for (int i = 0; i < kWaits; ++i) EXPECT_EQ(outcomes[i], i % 2 ? "done behind" : "failed behind") << i;
+  EXPECT_EQ(p.logger.count("continuing"), kWaits / 2u);
 }
 
 }  // namespace

@@ -123,32 +123,116 @@ struct FakeRandom : RandomSource {
   Locked<std::deque<std::uint32_t>> script_;
 };
 
-class ManualQueue : public SerialQueue {
+class ManualQueue;
+
+// A park of a ManualQueue; it holds the queue and the timeout closure until it ends.
+class ManualParking : public Parking {
  public:
-  ManualQueue(std::string label, QoS qos) : label_(std::move(label)), qos_(qos) {}
-  void async(Task task) override { tasks_.with([&](auto& t) { t.push_back(std::move(task)); }); }
+  ManualParking() = default;  // spent from the start
+  ManualParking(std::shared_ptr<ManualQueue> queue, Task onTimeout) {
+    held_.set(Held{std::move(queue), std::move(onTimeout)});
+  }
+  inline bool resume(Task next) override;
+  inline bool expire();
+  // Lets go of the queue and the timeout closure unrun.
+  void spend() { held_.set({}); }
+
+ private:
+  struct Held { std::shared_ptr<ManualQueue> queue; Task onTimeout; };
+  inline bool end(Task next, bool timedOut);
+  Locked<Held> held_;
+};
+
+// A serial queue run by hand. A park stops it until resumed, or until its dispatcher's
+// manual time passes the deadline (ManualDispatcher::advance).
+class ManualQueue : public SerialQueue, public std::enable_shared_from_this<ManualQueue> {
+ public:
+  using Nanos = std::chrono::nanoseconds;
+  // now: the manual time deadlines are measured on (the dispatcher's); a queue of its own otherwise.
+  ManualQueue(std::string label, QoS qos, std::shared_ptr<Locked<Nanos>> now = std::make_shared<Locked<Nanos>>())
+      : label_(std::move(label)), qos_(qos), now_(std::move(now)) {}
+  void async(Task task) override { state_.with([&](State& s) { s.tasks.push_back(std::move(task)); }); }
   const std::string& label() const override { return label_; }
+  std::shared_ptr<Parking> park(Nanos timeout, Task onTimeout) override {
+    parkTimeouts.add(timeout);
+    auto parking = std::make_shared<ManualParking>(shared_from_this(), std::move(onTimeout));
+    const Nanos due = now_->get() + timeout;
+    bool taken = state_.with([&](State& s) {
+      if (s.park) return false;
+      s.park = parking;
+      s.due = due;
+      return true;
+    });
+    if (taken) return parking;
+    parking->spend();
+    return std::make_shared<ManualParking>();
+  }
   QoS qos() const { return qos_; }
+  // Runs the next closure unless the queue is parked.
   bool runOne() {
-    auto task = popFront(tasks_);
+    auto task = state_.with([](State& s) -> std::optional<Task> {
+      if (s.park || s.tasks.empty()) return std::nullopt;
+      std::optional<Task> t(std::move(s.tasks.front()));
+      s.tasks.pop_front();
+      return t;
+    });
     if (task && *task) (*task)();
     return task.has_value();
   }
-  void clear() { tasks_.set({}); }
+  bool parked() const { return state_.with([](State& s) { return s.park != nullptr; }); }
+  // The deadline of the pending park, on the manual time.
+  std::optional<Nanos> deadline() const {
+    return state_.with([](State& s) { return s.park ? std::optional(s.due) : std::nullopt; });
+  }
+  // Times the pending park out when its deadline has come.
+  bool expireIfDue() {
+    auto park = state_.with([&](State& s) { return s.park && s.due <= now_->get() ? s.park : nullptr; });
+    return park && park->expire();
+  }
+  // Drops the queued closures and a pending park, whose timeout closure never runs.
+  void clear() {
+    State old = state_.with([](State& s) { return std::exchange(s, State{}); });
+    if (old.park) old.park->spend();
+  }
+  // The park ended: first goes to the head of the line.
+  void unpark(const ManualParking* which, Task first) {
+    std::shared_ptr<ManualParking> ended;  // released outside the lock
+    state_.with([&](State& s) {
+      if (s.park.get() == which) ended = std::exchange(s.park, nullptr);
+      if (first) s.tasks.push_front(std::move(first));
+    });
+  }
+  Recorder<Nanos> parkTimeouts;
 
  private:
+  struct State {
+    std::deque<Task> tasks;
+    std::shared_ptr<ManualParking> park;
+    Nanos due{};
+  };
   const std::string label_;
   const QoS qos_;
-  Locked<std::deque<Task>> tasks_;
+  const std::shared_ptr<Locked<Nanos>> now_;
+  Locked<State> state_;
 };
+
+bool ManualParking::resume(Task next) { return end(std::move(next), false); }
+bool ManualParking::expire() { return end(nullptr, true); }
+bool ManualParking::end(Task next, bool timedOut) {
+  Held held = held_.with([](Held& h) { return std::exchange(h, Held{}); });
+  if (!held.queue) return false;
+  held.queue->unpark(this, timedOut ? std::move(held.onTimeout) : std::move(next));
+  return true;
+}
 
 // Holds every submitted closure until the test runs it, on the test's thread;
 // queues are visited in creation order. Low-priority delays are recorded, not waited.
+// Parked queues wait for a resume or for advance() to pass their deadline.
 class ManualDispatcher : public Dispatcher {
  public:
   ~ManualDispatcher() override { clear(); }
   std::shared_ptr<SerialQueue> makeSerialQueue(std::string label, QoS qos) override {
-    auto q = std::make_shared<ManualQueue>(std::move(label), qos);
+    auto q = std::make_shared<ManualQueue>(std::move(label), qos, now_);
     queues_.add(q);
     return q;
   }
@@ -163,7 +247,7 @@ class ManualDispatcher : public Dispatcher {
     return nullptr;
   }
   // Runs serial-queue closures, including ones submitted meanwhile, until none is
-  // left; low-priority closures stay held.
+  // left that may run; low-priority closures stay held, parked queues stay parked.
   void runAll() {
     for (bool ran = true; ran;) {
       ran = false;
@@ -179,6 +263,31 @@ class ManualDispatcher : public Dispatcher {
   void runUntilIdle() { do runAll(); while (runLowPriority() != 0); }
   std::size_t pendingLowPriority() const { return lowPriority_.with([](auto& l) { return l.size(); }); }
   Recorder<std::chrono::nanoseconds> lowPriorityDelays;
+
+  // Moves the manual time on; parks whose deadline passes time out, earliest first
+  // (their timeout closures then wait for runAll).
+  std::size_t advance(std::chrono::nanoseconds d) {
+    now_->with([&](auto& now) { now += d; });
+    std::vector<std::pair<std::chrono::nanoseconds, std::shared_ptr<ManualQueue>>> due;
+    for (auto& q : queues())
+      if (auto at = q->deadline(); at && *at <= now_->get()) due.emplace_back(*at, q);
+    std::stable_sort(due.begin(), due.end(), [](auto& a, auto& b) { return a.first < b.first; });
+    std::size_t n = 0;
+    for (auto& [at, q] : due) n += q->expireIfDue() ? 1 : 0;
+    return n;
+  }
+  std::size_t parkedCount() const {
+    auto all = queues();
+    return static_cast<std::size_t>(std::count_if(all.begin(), all.end(), [](auto& q) { return q->parked(); }));
+  }
+  // Waits (on the real clock) until another thread has resumed every parked queue.
+  bool awaitUnparked(std::chrono::milliseconds budget = std::chrono::seconds(10)) const {
+    for (auto until = std::chrono::steady_clock::now() + budget; parkedCount() != 0;) {
+      if (std::chrono::steady_clock::now() > until) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return true;
+  }
   void clear() {
     lowPriority_.set({});
     for (auto& q : queues()) q->clear();
@@ -195,6 +304,8 @@ class ManualDispatcher : public Dispatcher {
   // Weak: a queue lives as long as its owner; the dispatcher only needs to find it.
   Recorder<std::weak_ptr<ManualQueue>> queues_;
   Locked<std::deque<Task>> lowPriority_;
+  // The manual time of the queues' deadlines.
+  std::shared_ptr<Locked<std::chrono::nanoseconds>> now_ = std::make_shared<Locked<std::chrono::nanoseconds>>();
 };
 
 struct SentMessage {
