@@ -144,7 +144,7 @@ int main(int argc, char** argv) {
   linux_platform::LinuxDiagnosticFiles files(directories.logs);
   linux_platform::StatsTreeLibrary driverStats(directories.runtime + "/stats");
   ExitProcessControl process([&store] { store.store->flush(kKillFlushBudget); });
-  // After the pool, so that it goes first: its handlers hold sessions.
+  // Its handlers hold sessions: stop() in finish lets them go while the rest is alive.
   daemon::SensorOrientationService orientation(*logger);
   orientation.start();
 

@@ -65,9 +65,19 @@ void SensorOrientationService::start() {
 }
 
 void SensorOrientationService::stop() {
-  if (!thread_.joinable()) return;
-  mailbox_->post([this] { sd_event_exit(event_.get(), 0); });
-  thread_.join();
+  if (thread_.joinable()) {
+    mailbox_->post([this] { sd_event_exit(event_.get(), 0); });
+    thread_.join();
+  }
+  // The handlers hold sessions: they go now, while the rest of the process they
+  // reach is still there, not when this object is destroyed.
+  Handlers device, interface;
+  {
+    std::lock_guard guard(lock_);
+    stopped_ = true;
+    device.swap(deviceHandlers_);
+    interface.swap(interfaceHandlers_);
+  }
 }
 
 void SensorOrientationService::run() {
@@ -186,6 +196,7 @@ void SensorOrientationService::pushInterfaceOrientation(Orientation orientation)
 OrientationHandler SensorOrientationService::setHandler(Handlers& handlers, const std::string& identifier,
                                                         OrientationHandler handler) {
   std::lock_guard guard(lock_);
+  if (stopped_) return handler;  // shutting down: nothing is kept
   return std::exchange(handlers[identifier], std::move(handler));
 }
 

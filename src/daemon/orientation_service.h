@@ -35,7 +35,8 @@ class SensorOrientationService final : public OrientationService {
 
   // Starts the service's thread, which connects to the system bus.
   void start();
-  // Ends the thread; handlers pushed afterwards run on the pushing thread.
+  // Ends the thread and drops every handler; an orientation pushed afterwards
+  // runs on the pushing thread and reaches nobody.
   void stop();
 
   // The shell's interface orientation; any thread.
@@ -66,8 +67,9 @@ class SensorOrientationService final : public OrientationService {
   static int onMailbox(sd_event_source* s, int fd, std::uint32_t revents, void* userdata);
 
   Logger& logger_;
-  std::mutex lock_;  // guards deviceHandlers_ and interfaceHandlers_
+  std::mutex lock_;  // guards deviceHandlers_, interfaceHandlers_ and stopped_
   Handlers deviceHandlers_, interfaceHandlers_;
+  bool stopped_ = false;
   std::shared_ptr<BusMailbox> mailbox_ = std::make_shared<BusMailbox>();
   std::thread thread_;  // owner's thread only
 

@@ -103,6 +103,7 @@ TEST_F(OrientationTest, InternalTelephonySessionsRecordOrientationAndTheClaimFol
   auto phone = startSession(*c, 1, 2, "phone");
   auto generic = startSession(*c, 2, 0, "player");
   auto music = startSession(*c, 3, 7, "music");
+  ASSERT_TRUE(c->getAllReporters());  // queued behind the starts: every session now orients
   // One claim for the process, however many sessions orient.
   ASSERT_TRUE(eventually([&] { return accelerometerOwners().size() == 1; })) << log();
 
