@@ -1,3 +1,4 @@
+#include "base/mutex.h"
 #include "vireo/client.h"
 
 #include <poll.h>
@@ -6,10 +7,8 @@
 
 #include <atomic>
 #include <cerrno>
-#include <condition_variable>
 #include <cstdlib>
 #include <cstring>
-#include <mutex>
 
 #include "platform/dbus/value_codec.h"
 
@@ -19,22 +18,20 @@ namespace detail {
 
 // The answer of a pending start, shared between the handle and the reply slot.
 struct StartState {
-  std::mutex mu;  // guards result
-  std::condition_variable cv;
-  std::optional<Result<bool>> result;
+  Mutex mu;  // guards result
+  std::optional<Result<bool>> result VIREO_GUARDED_BY(mu);
 
   void set(Result<bool> r) {
-    std::lock_guard lock(mu);
+    MutexLock lock(mu);
     if (!result) result.emplace(std::move(r));
-    cv.notify_all();
   }
 };
 
 struct Connection {
   // Guards bus: sd-bus objects are not thread-safe. Recursive so that an async
   // callback may issue the next call on the same connection.
-  mutable std::recursive_mutex mu;
-  sd_bus* bus = nullptr;
+  mutable RecursiveMutex mu;
+  sd_bus* bus VIREO_GUARDED_BY(mu) = nullptr;
   std::uint64_t timeoutUsec = 25'000'000;
   std::atomic<std::size_t> pending{0};
 
@@ -44,7 +41,7 @@ struct Connection {
 
   // Dispatches everything already received; called with mu held. True when
   // something was dispatched.
-  bool drain() {
+  bool drain() VIREO_REQUIRES(mu) {
     bool progress = false;
     while (sd_bus_process(bus, nullptr) > 0) progress = true;
     return progress;
@@ -55,14 +52,14 @@ struct Connection {
   void pumpOnce(std::chrono::milliseconds timeout) {
     int fd;
     {
-      std::lock_guard lock(mu);
+      RecursiveMutexLock lock(mu);
       if (drain()) return;
       fd = sd_bus_get_fd(bus);
     }
     if (fd < 0) return;
     pollfd p{fd, POLLIN, 0};
     ::poll(&p, 1, static_cast<int>(timeout.count()));
-    std::lock_guard lock(mu);
+    RecursiveMutexLock lock(mu);
     drain();
   }
 };
@@ -156,7 +153,7 @@ Error errorFromDBus(const std::string& name, const std::string& message) {
 
 bool StartHandle::ready() const {
   if (!state_) return true;
-  std::lock_guard lock(state_->mu);
+  MutexLock lock(state_->mu);
   return state_->result.has_value();
 }
 
@@ -165,7 +162,7 @@ std::optional<Result<bool>> StartHandle::waitFor(std::chrono::milliseconds timeo
   auto deadline = std::chrono::steady_clock::now() + timeout;
   for (;;) {
     {
-      std::lock_guard lock(state_->mu);
+      MutexLock lock(state_->mu);
       if (state_->result) return *state_->result;
     }
     auto conn = conn_.lock();
@@ -189,6 +186,7 @@ Client::~Client() = default;
 
 Result<std::unique_ptr<Client>> Client::connect(BusKind kind) {
   auto conn = std::make_shared<Connection>();
+  RecursiveMutexLock lock(conn->mu);  // not shared yet; keeps the analysis simple
   int r = resolveKind(kind) == BusKind::System ? sd_bus_open_system(&conn->bus) : sd_bus_open_user(&conn->bus);
   if (r < 0) return fail(r, "cannot connect to the bus");
   return std::unique_ptr<Client>(new Client(std::move(conn)));
@@ -196,6 +194,7 @@ Result<std::unique_ptr<Client>> Client::connect(BusKind kind) {
 
 Result<std::unique_ptr<Client>> Client::connectAddress(const std::string& address) {
   auto conn = std::make_shared<Connection>();
+  RecursiveMutexLock lock(conn->mu);  // not shared yet; keeps the analysis simple
   int r = sd_bus_new(&conn->bus);
   if (r < 0) return fail(r, "cannot create a bus connection");
   if ((r = sd_bus_set_address(conn->bus, address.c_str())) < 0) return fail(r, "bad bus address");
@@ -205,12 +204,12 @@ Result<std::unique_ptr<Client>> Client::connectAddress(const std::string& addres
 }
 
 void Client::setCallTimeout(std::chrono::microseconds timeout) {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   conn_->timeoutUsec = static_cast<std::uint64_t>(timeout.count());
 }
 
 std::string Client::uniqueName() const {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   const char* name = nullptr;
   if (sd_bus_get_unique_name(conn_->bus, &name) < 0 || !name) return {};
   return name;
@@ -228,7 +227,7 @@ int newCall(sd_bus* bus, const char* method, Fill&& fill, sd_bus_message** out) 
 
 template <class Fill>
 Result<sd_bus_message*> call(Connection& c, const char* method, Fill&& fill) {
-  std::lock_guard lock(c.mu);
+  RecursiveMutexLock lock(c.mu);
   Message m;
   int r = newCall(c.bus, method, fill, &m.m);
   if (r < 0) return errorFromErrno(r, "cannot build the call");
@@ -311,7 +310,7 @@ StartHandle Client::startReportingSessionForID(std::int64_t id) {
   StartHandle handle;
   handle.state_ = std::make_shared<detail::StartState>();
   handle.conn_ = conn_;
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   Message m;
   int r = newCall(conn_->bus, "StartReportingSessionForID",
                   [&](sd_bus_message* msg) { return sd_bus_message_append(msg, "x", id); }, &m.m);
@@ -344,7 +343,7 @@ namespace {
 
 template <class Fill>
 Status sendNoReply(Connection& c, const char* method, Fill&& fill) {
-  std::lock_guard lock(c.mu);
+  RecursiveMutexLock lock(c.mu);
   Message m;
   int r = newCall(c.bus, method, fill, &m.m);
   if (r >= 0) r = sd_bus_message_set_expect_reply(m.m, 0);
@@ -373,7 +372,7 @@ Status Client::sendMessage(const Dictionary& payload, std::uint32_t category, st
 Status Client::sendMessageAsync(const Dictionary& payload, std::uint32_t category, std::uint16_t type,
                                 const std::optional<std::vector<std::int64_t>>& ids,
                                 std::function<void(const Status&)> done) {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   Message m;
   int r = newCall(conn_->bus, "SendMessage",
                   [&](sd_bus_message* msg) { return appendMessageArgs(msg, payload, category, type, ids); }, &m.m);
@@ -433,7 +432,7 @@ Result<std::vector<std::int64_t>> Client::getAllReporters() {
 Status Client::killService() { return sendNoReply(*conn_, "KillService", noArgs); }
 
 Status Client::ping() {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   sd_bus_error e = SD_BUS_ERROR_NULL;
   int r = sd_bus_call_method(conn_->bus, kServiceName, kObjectPath, "org.freedesktop.DBus.Peer", "Ping", &e, nullptr,
                              "");
@@ -446,7 +445,7 @@ Status Client::ping() {
 }
 
 Result<Dictionary> Client::getStatus() {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   sd_bus_error e = SD_BUS_ERROR_NULL;
   sd_bus_message* reply = nullptr;
   int r = sd_bus_call_method(conn_->bus, kServiceName, kObjectPath, bus::kDebugInterface, "GetStatus", &e, &reply, "");
@@ -460,7 +459,7 @@ Result<Dictionary> Client::getStatus() {
 }
 
 Status Client::setInterfaceOrientation(const std::string& orientation) {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   sd_bus_error e = SD_BUS_ERROR_NULL;
   int r = sd_bus_call_method(conn_->bus, kServiceName, kObjectPath, bus::kOrientationInterface,
                              "SetInterfaceOrientation", &e, nullptr, "s", orientation.c_str());
@@ -480,7 +479,7 @@ std::size_t Client::pump(std::chrono::milliseconds timeout) {
 std::size_t Client::pendingCalls() const { return conn_->pending.load(); }
 
 Status Client::postNotification(const std::string& name) {
-  std::lock_guard lock(conn_->mu);
+  RecursiveMutexLock lock(conn_->mu);
   int r = sd_bus_emit_signal(conn_->bus, "/com/orvane/Notify1", "com.orvane.Notify1", "Posted", "s", name.c_str());
   if (r >= 0) r = sd_bus_flush(conn_->bus);
   if (r < 0) return errorFromErrno(r, "cannot post the notification");

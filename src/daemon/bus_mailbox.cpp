@@ -16,7 +16,7 @@ BusMailbox::~BusMailbox() {
 
 void BusMailbox::post(Task task) {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!closed_) {
       // Only the first task of a batch signals: the bus thread drains them all.
       const bool first = tasks_.empty();
@@ -28,7 +28,7 @@ void BusMailbox::post(Task task) {
       return;
     }
   }
-  std::lock_guard inlineLock(inlineMutex_);
+  RecursiveMutexLock inlineLock(inlineMutex_);
   task();
 }
 
@@ -39,7 +39,7 @@ void BusMailbox::drain() {
   }
   std::vector<Task> tasks;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     tasks.swap(tasks_);
   }
   for (Task& t : tasks) t();
@@ -47,10 +47,10 @@ void BusMailbox::drain() {
 
 void BusMailbox::close() {
   // Held before closing, so that a task posted from now on runs after the queued ones.
-  std::lock_guard inlineLock(inlineMutex_);
+  RecursiveMutexLock inlineLock(inlineMutex_);
   std::vector<Task> tasks;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     closed_ = true;
     tasks.swap(tasks_);
   }

@@ -9,8 +9,9 @@
 #pragma once
 
 #include <functional>
-#include <mutex>
 #include <vector>
+
+#include "base/mutex.h"
 
 namespace vireo::daemon {
 
@@ -33,10 +34,10 @@ class BusMailbox {
 
  private:
   int fd_ = -1;
-  std::mutex mutex_;  // guards tasks_ and closed_
-  std::vector<Task> tasks_;
-  bool closed_ = false;
-  std::recursive_mutex inlineMutex_;  // serialises tasks run after close()
+  Mutex mutex_;  // guards tasks_ and closed_
+  std::vector<Task> tasks_ VIREO_GUARDED_BY(mutex_);
+  bool closed_ VIREO_GUARDED_BY(mutex_) = false;
+  RecursiveMutex inlineMutex_ VIREO_ACQUIRED_BEFORE(mutex_);  // serialises tasks run after close()
 };
 
 }  // namespace vireo::daemon

@@ -9,29 +9,29 @@ std::string PeerConnection::description() const {
 }
 
 void PeerConnection::setExportedObject(std::shared_ptr<VRReportingServiceProtocol> object) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   exported_ = std::move(object);
 }
 
 void PeerConnection::setInterruptionHandler(std::function<void()> handler) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   interruptionHandler_ = std::move(handler);
 }
 
 void PeerConnection::setInvalidationHandler(std::function<void()> handler) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   invalidationHandler_ = std::move(handler);
 }
 
 std::shared_ptr<VRReportingServiceProtocol> PeerConnection::exportedObject() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return exported_;
 }
 
 void PeerConnection::invalidate() {
   std::function<void()> handler;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (invalidated_) return;
     invalidated_ = true;
     handler = std::move(invalidationHandler_);

@@ -12,11 +12,11 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+#include "base/mutex.h"
 #include "platform/connection.h"
 
 namespace vireo::daemon {
@@ -41,11 +41,11 @@ class PeerConnection final : public ClientConnection {
  private:
   const std::string name_;
   const std::int32_t pid_;
-  mutable std::mutex mutex_;  // guards exported_, the handlers and invalidated_
-  std::shared_ptr<VRReportingServiceProtocol> exported_;
-  std::function<void()> interruptionHandler_;  // kept, never called: D-Bus has no interruption
-  std::function<void()> invalidationHandler_;
-  bool invalidated_ = false;
+  mutable Mutex mutex_;  // guards exported_, the handlers and invalidated_
+  std::shared_ptr<VRReportingServiceProtocol> exported_ VIREO_GUARDED_BY(mutex_);
+  std::function<void()> interruptionHandler_ VIREO_GUARDED_BY(mutex_);  // kept, never called: D-Bus has no interruption
+  std::function<void()> invalidationHandler_ VIREO_GUARDED_BY(mutex_);
+  bool invalidated_ VIREO_GUARDED_BY(mutex_) = false;
 };
 
 class ClientRegistry {

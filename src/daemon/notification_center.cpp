@@ -7,7 +7,7 @@ namespace vireo::daemon {
 int NotificationCenter::registerDispatch(std::string name, std::shared_ptr<SerialQueue> queue,
                                          std::function<void(int token)> handler, int* token) {
   if (name.empty() || !queue || !handler) return 1;
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   int t = ++lastToken_;
   registrations_.push_back({std::move(name), std::move(queue), std::move(handler), t});
   if (token) *token = t;
@@ -17,7 +17,7 @@ int NotificationCenter::registerDispatch(std::string name, std::shared_ptr<Seria
 void NotificationCenter::post(std::string_view name) {
   std::vector<Registration> matching;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     for (const auto& r : registrations_)
       if (r.name == name) matching.push_back(r);
   }

@@ -3,11 +3,11 @@
 // arrives (or SIGHUP, for the defaults notification).
 #pragma once
 
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "base/mutex.h"
 #include "platform/defaults.h"
 
 namespace vireo::daemon {
@@ -28,9 +28,9 @@ class NotificationCenter final : public NotificationService {
     std::function<void(int)> handler;
     int token;
   };
-  std::mutex mutex_;  // guards registrations_ and lastToken_
-  std::vector<Registration> registrations_;
-  int lastToken_ = 0;
+  Mutex mutex_;  // guards registrations_ and lastToken_
+  std::vector<Registration> registrations_ VIREO_GUARDED_BY(mutex_);
+  int lastToken_ VIREO_GUARDED_BY(mutex_) = 0;
 };
 
 }  // namespace vireo::daemon

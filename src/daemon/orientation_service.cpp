@@ -73,7 +73,7 @@ void SensorOrientationService::stop() {
   // reach is still there, not when this object is destroyed.
   Handlers device, interface;
   {
-    std::lock_guard guard(lock_);
+    MutexLock guard(lock_);
     stopped_ = true;
     device.swap(deviceHandlers_);
     interface.swap(interfaceHandlers_);
@@ -148,7 +148,7 @@ void SensorOrientationService::reconcileClaim() {
   if (!bus_ || proxyOwner_.empty() || claim_ == Claim::Pending) return;
   bool wanted;
   {
-    std::lock_guard guard(lock_);
+    MutexLock guard(lock_);
     wanted = !deviceHandlers_.empty();
   }
   if (wanted && claim_ == Claim::None) {
@@ -170,11 +170,11 @@ void SensorOrientationService::reconcileClaim() {
   }
 }
 
-void SensorOrientationService::deliver(Handlers& handlers, Orientation orientation) {
+void SensorOrientationService::deliver(Kind kind, Orientation orientation) {
   std::vector<OrientationHandler> calls;
   {
-    std::lock_guard guard(lock_);
-    for (auto& [identifier, handler] : handlers) calls.push_back(handler);
+    MutexLock guard(lock_);
+    for (auto& [identifier, handler] : handlers(kind)) calls.push_back(handler);
   }
   // Outside the lock: a handler may register or unregister.
   for (auto& handler : calls) {
@@ -189,44 +189,44 @@ void SensorOrientationService::deliver(Handlers& handlers, Orientation orientati
 }
 
 void SensorOrientationService::pushInterfaceOrientation(Orientation orientation) {
-  mailbox_->post([this, orientation] { deliver(interfaceHandlers_, orientation); });
+  mailbox_->post([this, orientation] { deliver(Kind::Interface, orientation); });
 }
 
 // Both return the handler they take out, to be released outside the lock: it may hold a session.
-OrientationHandler SensorOrientationService::setHandler(Handlers& handlers, const std::string& identifier,
+OrientationHandler SensorOrientationService::setHandler(Kind kind, const std::string& identifier,
                                                         OrientationHandler handler) {
-  std::lock_guard guard(lock_);
+  MutexLock guard(lock_);
   if (stopped_) return handler;  // shutting down: nothing is kept
-  return std::exchange(handlers[identifier], std::move(handler));
+  return std::exchange(handlers(kind)[identifier], std::move(handler));
 }
 
-OrientationHandler SensorOrientationService::removeHandler(Handlers& handlers, const std::string& identifier) {
-  std::lock_guard guard(lock_);
-  auto it = handlers.find(identifier);
-  if (it == handlers.end()) return {};
+OrientationHandler SensorOrientationService::removeHandler(Kind kind, const std::string& identifier) {
+  MutexLock guard(lock_);
+  auto it = handlers(kind).find(identifier);
+  if (it == handlers(kind).end()) return {};
   OrientationHandler removed = std::move(it->second);
-  handlers.erase(it);
+  handlers(kind).erase(it);
   return removed;
 }
 
 void SensorOrientationService::registerDeviceOrientationHandler(const std::string& identifier,
                                                                 OrientationHandler handler) {
-  setHandler(deviceHandlers_, identifier, std::move(handler));
+  setHandler(Kind::Device, identifier, std::move(handler));
   mailbox_->post([this] { reconcileClaim(); });
 }
 
 void SensorOrientationService::registerInterfaceOrientationHandler(const std::string& identifier,
                                                                    OrientationHandler handler) {
-  setHandler(interfaceHandlers_, identifier, std::move(handler));
+  setHandler(Kind::Interface, identifier, std::move(handler));
 }
 
 void SensorOrientationService::unregisterDeviceOrientationHandler(const std::string& identifier) {
-  removeHandler(deviceHandlers_, identifier);
+  removeHandler(Kind::Device, identifier);
   mailbox_->post([this] { reconcileClaim(); });
 }
 
 void SensorOrientationService::unregisterInterfaceOrientationHandler(const std::string& identifier) {
-  removeHandler(interfaceHandlers_, identifier);
+  removeHandler(Kind::Interface, identifier);
 }
 
 int SensorOrientationService::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error*) {
@@ -269,7 +269,7 @@ int SensorOrientationService::onPropertiesChanged(sd_bus_message* m, void* userd
   const char* sender = sd_bus_message_get_sender(m);
   if (self.proxyOwner_.empty() || !sender || self.proxyOwner_ != sender) return 0;
   if (auto text = readOrientationChange(m))
-    self.deliver(self.deviceHandlers_, orientationFromText(*text).value_or(Orientation::Undefined));
+    self.deliver(Kind::Device, orientationFromText(*text).value_or(Orientation::Undefined));
   return 0;
 }
 

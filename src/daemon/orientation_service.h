@@ -15,10 +15,10 @@
 #include <cstdint>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 
+#include "base/mutex.h"
 #include "daemon/bus_mailbox.h"
 #include "platform/dbus/bus.h"
 #include "platform/logger.h"
@@ -56,9 +56,13 @@ class SensorOrientationService final : public OrientationService {
   void dropSensorBus();
   void proxyOwnerChanged(std::string owner);
   void reconcileClaim();
-  void deliver(Handlers& handlers, Orientation orientation);
-  OrientationHandler setHandler(Handlers& handlers, const std::string& identifier, OrientationHandler handler);
-  OrientationHandler removeHandler(Handlers& handlers, const std::string& identifier);
+  enum class Kind { Device, Interface };
+  Handlers& handlers(Kind kind) VIREO_REQUIRES(lock_) {
+    return kind == Kind::Device ? deviceHandlers_ : interfaceHandlers_;
+  }
+  void deliver(Kind kind, Orientation orientation);
+  OrientationHandler setHandler(Kind kind, const std::string& identifier, OrientationHandler handler);
+  OrientationHandler removeHandler(Kind kind, const std::string& identifier);
   static int onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
   static int onInitialOwner(sd_bus_message* m, void* userdata, sd_bus_error* error);
   static int onPropertiesChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
@@ -67,9 +71,10 @@ class SensorOrientationService final : public OrientationService {
   static int onMailbox(sd_event_source* s, int fd, std::uint32_t revents, void* userdata);
 
   Logger& logger_;
-  std::mutex lock_;  // guards deviceHandlers_, interfaceHandlers_ and stopped_
-  Handlers deviceHandlers_, interfaceHandlers_;
-  bool stopped_ = false;
+  Mutex lock_;  // guards deviceHandlers_, interfaceHandlers_ and stopped_
+  Handlers deviceHandlers_ VIREO_GUARDED_BY(lock_);
+  Handlers interfaceHandlers_ VIREO_GUARDED_BY(lock_);
+  bool stopped_ VIREO_GUARDED_BY(lock_) = false;
   std::shared_ptr<BusMailbox> mailbox_ = std::make_shared<BusMailbox>();
   std::thread thread_;  // owner's thread only
 

@@ -1,3 +1,4 @@
+#include "base/mutex.h"
 #include "dispatch/thread_pool.h"
 
 #include <algorithm>
@@ -6,7 +7,6 @@
 #include <condition_variable>
 #include <cstdint>
 #include <deque>
-#include <mutex>
 #include <system_error>
 #include <thread>
 #include <vector>
@@ -85,10 +85,10 @@ class ThreadPoolDispatcher::Core {
 
   void workerMain();
   void timerMain();
-  bool startTimerLocked();
-  bool popReadyLocked(Ready& out);
-  bool hasReadyLocked() const;
-  bool shouldWakeLocked(bool hadReady) const;
+  bool startTimerLocked() VIREO_REQUIRES(timerMu_);
+  bool popReadyLocked(Ready& out) VIREO_REQUIRES(mu_);
+  bool hasReadyLocked() const VIREO_REQUIRES(mu_);
+  bool shouldWakeLocked(bool hadReady) const VIREO_REQUIRES(mu_);
   bool onWorkerThread() const;
 
   const Options options_;
@@ -97,20 +97,20 @@ class ThreadPoolDispatcher::Core {
   std::atomic<std::size_t> pending_{0};
 
   // mu_ guards ready_, workers_ and threads_ (and orders drainCv_ wakeups).
-  mutable std::mutex mu_;
+  mutable Mutex mu_;
   std::condition_variable workCv_;
   std::condition_variable drainCv_;
-  std::array<std::deque<Ready>, kClassCount> ready_;
-  std::vector<std::thread> workers_;
-  std::size_t threads_ = 0;  // workers alive
+  std::array<std::deque<Ready>, kClassCount> ready_ VIREO_GUARDED_BY(mu_);
+  std::vector<std::thread> workers_ VIREO_GUARDED_BY(mu_);
+  std::size_t threads_ VIREO_GUARDED_BY(mu_) = 0;  // workers alive
 
   // timerMu_ guards delayed_ (a min-heap by due time), sequence_, timer_ and timerStop_.
-  std::mutex timerMu_;
+  Mutex timerMu_;
   std::condition_variable timerCv_;
-  std::vector<Delayed> delayed_;
-  std::uint64_t sequence_ = 0;
-  std::thread timer_;
-  bool timerStop_ = false;
+  std::vector<Delayed> delayed_ VIREO_GUARDED_BY(timerMu_);
+  std::uint64_t sequence_ VIREO_GUARDED_BY(timerMu_) = 0;
+  std::thread timer_ VIREO_GUARDED_BY(timerMu_);
+  bool timerStop_ VIREO_GUARDED_BY(timerMu_) = false;
 };
 
 // One park of one queue. It holds the queue (and the timeout closure) until it ends,
@@ -131,9 +131,9 @@ class PoolParking final : public Parking {
  private:
   bool end(Task next, bool timedOut);
 
-  std::mutex mu_;  // guards queue_ and onTimeout_; queue_ is empty once the park has ended
-  std::shared_ptr<PoolQueue> queue_;
-  Task onTimeout_;
+  Mutex mu_;  // guards queue_ and onTimeout_; queue_ is empty once the park has ended
+  std::shared_ptr<PoolQueue> queue_ VIREO_GUARDED_BY(mu_);
+  Task onTimeout_ VIREO_GUARDED_BY(mu_);
 };
 
 // A serial queue: its own FIFO, a flag telling whether it sits in (or is being run
@@ -148,7 +148,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
     core_->taskAdded();
     bool schedule = false;
     {
-      std::lock_guard lock(mu_);
+      MutexLock lock(mu_);
       fifo_.push_back(std::move(task));
       schedule = !scheduled_ && !park_;
       if (schedule) scheduled_ = true;
@@ -167,7 +167,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
     core_->taskAdded();
     bool refused;
     {
-      std::lock_guard lock(mu_);
+      MutexLock lock(mu_);
       refused = park_ != nullptr;
       if (!refused) park_ = parking;
     }
@@ -188,7 +188,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
       {
         Task task;
         {
-          std::lock_guard lock(mu_);
+          MutexLock lock(mu_);
           if (fifo_.empty() || park_) {
             scheduled_ = false;
             return false;
@@ -200,7 +200,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
       }  // the closure's captures are released before it counts as finished
       core_->taskFinished();
     }
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     if (fifo_.empty() || park_) scheduled_ = false;
     return scheduled_;
   }
@@ -210,7 +210,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
     std::shared_ptr<Parking> ended;  // released outside the lock
     bool schedule = false, counted = false;
     {
-      std::lock_guard lock(mu_);
+      MutexLock lock(mu_);
       if (park_.get() == which) ended = std::move(park_);
       if (first) {
         fifo_.push_front(std::move(first));
@@ -228,7 +228,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
     std::shared_ptr<Parking> ended;
     std::deque<Task> dropped;
     {
-      std::lock_guard lock(mu_);
+      MutexLock lock(mu_);
       if (park_.get() == which) ended = std::move(park_);
       dropped.swap(fifo_);
     }
@@ -241,7 +241,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
   void clear() {
     std::deque<Task> dropped;
     {
-      std::lock_guard lock(mu_);
+      MutexLock lock(mu_);
       dropped.swap(fifo_);
       scheduled_ = false;
     }
@@ -254,17 +254,17 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
   const std::shared_ptr<ThreadPoolDispatcher::Core> core_;
   const std::string label_;
   const QoS qos_;
-  std::mutex mu_;  // guards fifo_, scheduled_ and park_
-  std::deque<Task> fifo_;
-  bool scheduled_ = false;
-  std::shared_ptr<PoolParking> park_;  // pending park; the queue runs nothing while set
+  Mutex mu_;  // guards fifo_, scheduled_ and park_
+  std::deque<Task> fifo_ VIREO_GUARDED_BY(mu_);
+  bool scheduled_ VIREO_GUARDED_BY(mu_) = false;
+  std::shared_ptr<PoolParking> park_ VIREO_GUARDED_BY(mu_);  // pending park; the queue runs nothing while set
 };
 
 bool PoolParking::end(Task next, bool timedOut) {
   std::shared_ptr<PoolQueue> queue;
   Task onTimeout;  // released here when resumed: its captures go as soon as the wait ends
   {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     queue = std::move(queue_);
     onTimeout = std::move(onTimeout_);
     onTimeout_ = nullptr;
@@ -278,7 +278,7 @@ void PoolParking::drop() {
   std::shared_ptr<PoolQueue> queue;
   Task onTimeout;
   {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     queue = std::move(queue_);
     onTimeout = std::move(onTimeout_);
     onTimeout_ = nullptr;
@@ -300,7 +300,7 @@ ThreadPoolDispatcher::Core::Core(Options options) : options_([&] {
 ThreadPoolDispatcher::Core::~Core() { shutdown(); }
 
 void ThreadPoolDispatcher::Core::start() {
-  std::lock_guard lock(mu_);
+  MutexLock lock(mu_);
   for (std::size_t i = 0; i < options_.workers; ++i) {
     try {
       workers_.emplace_back([this] { workerMain(); });
@@ -330,7 +330,7 @@ bool ThreadPoolDispatcher::Core::popReadyLocked(Ready& out) {
 
 void ThreadPoolDispatcher::Core::workerMain() {
   tlsCurrentCore = this;
-  std::unique_lock lock(mu_);
+  MutexLock lock(mu_);
   while (!stopping()) {
     Ready item;
     if (popReadyLocked(item)) {
@@ -352,7 +352,7 @@ void ThreadPoolDispatcher::Core::workerMain() {
       lock.lock();
       continue;
     }
-    workCv_.wait(lock, [&] { return stopping() || hasReadyLocked(); });
+    lock.wait(workCv_);  // the loop checks again: stopping, or something ready
   }
   --threads_;
   lock.unlock();
@@ -361,7 +361,7 @@ void ThreadPoolDispatcher::Core::workerMain() {
 
 void ThreadPoolDispatcher::Core::taskFinished() {
   if (pending_.fetch_sub(1, std::memory_order_acq_rel) == 1) {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     drainCv_.notify_all();
   }
 }
@@ -377,7 +377,7 @@ bool ThreadPoolDispatcher::Core::shouldWakeLocked(bool hadReady) const {
 void ThreadPoolDispatcher::Core::submitQueue(std::shared_ptr<PoolQueue> queue, QoS qos) {
   bool wake = false;
   {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     if (!stopping()) {
       wake = shouldWakeLocked(hasReadyLocked());
       ready_[classIndex(qos)].push_back(Ready{std::move(queue), nullptr});
@@ -396,7 +396,7 @@ void ThreadPoolDispatcher::Core::submitTask(Task task, QoS qos) {
   taskAdded();
   bool wake = false;
   {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     if (!stopping()) {
       wake = shouldWakeLocked(hasReadyLocked());
       ready_[classIndex(qos)].push_back(Ready{nullptr, std::move(task)});
@@ -428,7 +428,7 @@ void ThreadPoolDispatcher::Core::submitDelayed(std::chrono::nanoseconds delay, T
     return;
   }
   auto due = std::chrono::steady_clock::now() + std::chrono::duration_cast<std::chrono::steady_clock::duration>(delay);
-  std::lock_guard lock(timerMu_);
+  MutexLock lock(timerMu_);
   if (timerStop_ || !startTimerLocked()) return;
   bool earliest = delayed_.empty() || due < delayed_.front().due;
   delayed_.push_back(Delayed{due, sequence_++, std::move(task), nullptr});
@@ -441,7 +441,7 @@ bool ThreadPoolDispatcher::Core::armDeadline(std::chrono::nanoseconds timeout, s
              std::chrono::duration_cast<std::chrono::steady_clock::duration>(std::max(timeout, std::chrono::nanoseconds::zero()));
   bool noTimer = false;
   {
-    std::lock_guard lock(timerMu_);
+    MutexLock lock(timerMu_);
     if (timerStop_) return false;
     if (startTimerLocked()) {
       bool earliest = delayed_.empty() || due < delayed_.front().due;
@@ -458,16 +458,16 @@ bool ThreadPoolDispatcher::Core::armDeadline(std::chrono::nanoseconds timeout, s
 }
 
 void ThreadPoolDispatcher::Core::timerMain() {
-  std::unique_lock lock(timerMu_);
+  MutexLock lock(timerMu_);
   while (!timerStop_) {
     if (delayed_.empty()) {
-      timerCv_.wait(lock);
+      lock.wait(timerCv_);
       continue;
     }
     // A copy: the heap may grow, and move its elements, while this thread waits.
     SteadyTime due = delayed_.front().due;
     if (due > std::chrono::steady_clock::now()) {
-      timerCv_.wait_until(lock, due);
+      lock.waitUntil(timerCv_, due);
       continue;
     }
     std::pop_heap(delayed_.begin(), delayed_.end(), laterThan);
@@ -485,12 +485,15 @@ void ThreadPoolDispatcher::Core::timerMain() {
 }
 
 bool ThreadPoolDispatcher::Core::drain(std::chrono::milliseconds budget) {
-  std::unique_lock lock(mu_);
-  return drainCv_.wait_for(lock, budget, [&] { return pending_.load(std::memory_order_acquire) == 0; });
+  MutexLock lock(mu_);
+  const auto deadline = std::chrono::steady_clock::now() + budget;
+  while (pending_.load(std::memory_order_acquire) != 0)
+    if (lock.waitUntil(drainCv_, deadline) == std::cv_status::timeout) return pending_.load(std::memory_order_acquire) == 0;
+  return true;
 }
 
 std::size_t ThreadPoolDispatcher::Core::workerCount() const {
-  std::lock_guard lock(mu_);
+  MutexLock lock(mu_);
   return threads_;
 }
 
@@ -503,7 +506,7 @@ void ThreadPoolDispatcher::Core::shutdown() {
   }
   std::vector<std::thread> workers;
   {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     stopping_.store(true, std::memory_order_release);
     workers.swap(workers_);
   }
@@ -511,7 +514,7 @@ void ThreadPoolDispatcher::Core::shutdown() {
   std::thread timer;
   std::vector<Delayed> delayed;
   {
-    std::lock_guard lock(timerMu_);
+    MutexLock lock(timerMu_);
     timerStop_ = true;
     timer.swap(timer_);
     delayed.swap(delayed_);
@@ -527,7 +530,7 @@ void ThreadPoolDispatcher::Core::shutdown() {
 
   std::array<std::deque<Ready>, kClassCount> left;
   {
-    std::lock_guard lock(mu_);
+    MutexLock lock(mu_);
     left.swap(ready_);
   }
   for (auto& list : left) {

@@ -35,7 +35,7 @@ void VRReportingServiceDelegate::registerClient(const std::weak_ptr<VRReportingS
   auto instance = weakInstance.lock();
   if (!instance) return;  // the connection is already gone
   {
-    std::lock_guard guard(registryLock_);
+    MutexLock guard(registryLock_);
     clients_.push_back(instance);
   }
   instance->setClientStartDate(env_->platform.clock.now());

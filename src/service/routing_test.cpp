@@ -36,7 +36,7 @@ class RoutingTest : public ::testing::Test {
   static long payloads(const std::shared_ptr<VRReportingSession>& s) {
     auto data = s ? s->aggregatedPayloadData() : nullptr;
     if (!data) return -1;
-    std::lock_guard guard(data->lock);
+    MutexLock guard(data->lock);
     return static_cast<long>(data->entries.size());
   }
   // Sends from client a and returns its one reply (an error when there was not exactly one).

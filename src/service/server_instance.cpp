@@ -43,34 +43,34 @@ VRReportingServerInstance::~VRReportingServerInstance() {
 // ---- properties ----
 
 std::optional<WallTime> VRReportingServerInstance::clientStartDate() const {
-  std::lock_guard guard(propertiesLock_);
+  MutexLock guard(propertiesLock_);
   return clientStartDate_;
 }
 
 void VRReportingServerInstance::setClientStartDate(std::optional<WallTime> date) {
-  std::lock_guard guard(propertiesLock_);
+  MutexLock guard(propertiesLock_);
   clientStartDate_ = date;
 }
 
 std::optional<std::string> VRReportingServerInstance::clientProcessName() const {
-  std::lock_guard guard(propertiesLock_);
+  MutexLock guard(propertiesLock_);
   return clientProcessName_;
 }
 
 void VRReportingServerInstance::setClientProcessName(std::optional<std::string> name) {
-  std::lock_guard guard(propertiesLock_);
+  MutexLock guard(propertiesLock_);
   clientProcessName_ = std::move(name);
 }
 
 std::vector<ReportingSessionMap::Entry> VRReportingServerInstance::clientReportingSessionMap() const {
-  std::lock_guard guard(propertiesLock_);
+  MutexLock guard(propertiesLock_);
   return clientReportingSessionMap_.entries();
 }
 
 std::shared_ptr<VRReportingSession> VRReportingServerInstance::findReportingSessionForID(std::int64_t reporterID,
                                                                                         bool acrossAllClients) const {
   {
-    std::lock_guard guard(propertiesLock_);
+    MutexLock guard(propertiesLock_);
     if (auto session = clientReportingSessionMap_.find(reporterID)) return session;
   }
   if (!acrossAllClients) return nullptr;
@@ -109,7 +109,7 @@ void VRReportingServerInstance::createReportingSession(std::int64_t reporterID, 
     if (session) {
       std::shared_ptr<VRReportingSession> replaced;
       {
-        std::lock_guard guard(self->propertiesLock_);
+        MutexLock guard(self->propertiesLock_);
         replaced = self->clientReportingSessionMap_.find(reporterID);
         self->clientReportingSessionMap_.set(reporterID, std::move(session));
       }
@@ -240,7 +240,7 @@ void VRReportingServerInstance::doDestroy(std::int64_t reporterID, BoolReply rep
   }
   if (auto session = findReportingSessionForID(reporterID, false)) {
     if (session->started()) session->stop();
-    std::lock_guard guard(propertiesLock_);
+    MutexLock guard(propertiesLock_);
     clientReportingSessionMap_.erase(reporterID);
   }  // the session is released here, outside the lock
   VR_LOG(env_->logger(), LogScope::Server, LogLevel::Default,

@@ -8,11 +8,11 @@
 
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "base/mutex.h"
 #include "dispatch/dispatch.h"
 #include "platform/clock.h"
 #include "service/reporting_protocol.h"
@@ -87,10 +87,10 @@ class VRReportingServerInstance final : public VRReportingServiceProtocol,
   // Guards the three fields below, and nothing else. They change on the server queue
   // only, but the connection handlers and the registry lookup read them from other
   // threads. Never held while calling out (sessions, sinks, replies, the delegate).
-  mutable std::mutex propertiesLock_;
-  std::optional<WallTime> clientStartDate_;
-  std::optional<std::string> clientProcessName_;
-  ReportingSessionMap clientReportingSessionMap_;
+  mutable Mutex propertiesLock_;
+  std::optional<WallTime> clientStartDate_ VIREO_GUARDED_BY(propertiesLock_);
+  std::optional<std::string> clientProcessName_ VIREO_GUARDED_BY(propertiesLock_);
+  ReportingSessionMap clientReportingSessionMap_ VIREO_GUARDED_BY(propertiesLock_);
 };
 
 }  // namespace vireo

@@ -31,7 +31,7 @@ bool VRReportingServiceDelegate::shouldAcceptNewConnection(ClientConnection& con
          connection.description().c_str());
   std::shared_ptr<VRReportingServerInstance> instance;
   {
-    std::lock_guard guard(objectLock_);
+    MutexLock guard(objectLock_);
     instance = VRReportingServerInstance::initWithPID(env_, serverQueue_, pid, weak_from_this());
     connection.setExportedObject(instance);
   }
@@ -52,19 +52,19 @@ bool VRReportingServiceDelegate::shouldAcceptNewConnection(ClientConnection& con
 // ---- registry ----
 
 std::optional<Dictionary> VRReportingServiceDelegate::getDefaults() const {
-  std::lock_guard guard(registryLock_);
+  MutexLock guard(registryLock_);
   return defaults_;
 }
 
 std::vector<std::shared_ptr<VRReportingServerInstance>> VRReportingServiceDelegate::getAllClients() const {
-  std::lock_guard guard(registryLock_);
+  MutexLock guard(registryLock_);
   return clients_;
 }
 
 void VRReportingServiceDelegate::removeClient(const std::shared_ptr<VRReportingServerInstance>& client) {
   std::vector<std::shared_ptr<VRReportingServerInstance>> removed;
   {
-    std::lock_guard guard(registryLock_);
+    MutexLock guard(registryLock_);
     auto tail = std::stable_partition(clients_.begin(), clients_.end(), [&](const auto& c) { return c != client; });
     removed.assign(std::make_move_iterator(tail), std::make_move_iterator(clients_.end()));
     clients_.erase(tail, clients_.end());
@@ -74,7 +74,7 @@ void VRReportingServiceDelegate::removeClient(const std::shared_ptr<VRReportingS
 
 std::shared_ptr<VRReportingSession> VRReportingServiceDelegate::findReportingSessionForID(std::int64_t reporterID) {
   constexpr const char* kLabel = "-[VRReportingServiceDelegate findReportingSessionForID:]";
-  std::lock_guard guard(objectLock_);
+  MutexLock guard(objectLock_);
   if (reporterID == 0) return nullptr;
   if (!reportingEnabled_.load()) return nullptr;
   for (const auto& client : getAllClients()) {
@@ -132,7 +132,7 @@ void VRReportingServiceDelegate::defaultsChanged(int token) {
   VR_LOG(env_->logger(), LogScope::Server, LogLevel::Default, kLabel, "re-reading vireo defaults");
   Dictionary defaults = VRReportingDefaults();
   {
-    std::lock_guard guard(registryLock_);
+    MutexLock guard(registryLock_);
     defaults_ = defaults;
   }
   VR_LOG(env_->logger(), LogScope::Server, LogLevel::Info, kLabel, "defaults %s", Value(defaults).text().c_str());

@@ -9,11 +9,11 @@
 #include <atomic>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "base/mutex.h"
 #include "base/value.h"
 #include "dispatch/dispatch.h"
 #include "drivers/driver_utility.h"
@@ -84,14 +84,14 @@ class VRReportingServiceDelegate final : public VRReportingServiceDelegateProtoc
   // The delegate's object lock: held while a connection's exported object is set up
   // and for the whole of a lookup across all clients. Taken before registryLock_ and
   // the instances' own property locks, never after.
-  std::mutex objectLock_;
+  Mutex objectLock_ VIREO_ACQUIRED_BEFORE(registryLock_);
 
   // Guards clients_ and defaults_ for readers on other threads. Both change only on
   // the server queue; the lock is held just for the copy in or out, never while
   // calling out.
-  mutable std::mutex registryLock_;
-  std::vector<std::shared_ptr<VRReportingServerInstance>> clients_;
-  std::optional<Dictionary> defaults_;
+  mutable Mutex registryLock_;
+  std::vector<std::shared_ptr<VRReportingServerInstance>> clients_ VIREO_GUARDED_BY(registryLock_);
+  std::optional<Dictionary> defaults_ VIREO_GUARDED_BY(registryLock_);
 
   std::atomic<bool> reportingEnabled_{true};
 };

@@ -29,7 +29,7 @@ bool VRReportingSession::shouldReportOrientation() {
 void VRReportingSession::registerOrientationHandlers() {
   std::string identifier = "VRReportingService " + std::to_string(reporterID_);
   {
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     orientationCallbackID_ = identifier;
     startDate_ = env_->platform.clock.now();
   }
@@ -47,7 +47,7 @@ void VRReportingSession::unregisterOrientationHandlers() {
   OrientationService& orientation = env_->platform.orientation;
   orientation.unregisterDeviceOrientationHandler(*identifier);
   orientation.unregisterInterfaceOrientationHandler(*identifier);
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   orientationCallbackID_.reset();
 }
 
@@ -57,7 +57,7 @@ void VRReportingSession::orientationChanged(const char* mode, Orientation orient
   std::optional<std::string> identifier;
   Value application;
   {
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     payloads = aggregatedPayloadData_;
     startDate = startDate_;
     identifier = orientationCallbackID_;

@@ -55,7 +55,7 @@ void VRReportingSession::setServiceType(std::uint16_t serviceType) {
   std::string name = serviceNameOrUnknown(serviceType);
   serviceType_ = serviceType;
   {
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     serviceName_ = name;
   }
   VR_LOG(env_->logger(), LogScope::Session, LogLevel::Info, "-[VRReportingSession setServiceType:]",
@@ -64,7 +64,7 @@ void VRReportingSession::setServiceType(std::uint16_t serviceType) {
 
 void VRReportingSession::setConfiguration(const Dictionary* configuration) {
   if (!configuration) return;
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   userInfo_.merge(*configuration);
 }
 
@@ -85,7 +85,7 @@ void VRReportingSession::start() {
   Dictionary userInfo;
   std::string serviceName;
   {
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     aggregatedPayloadData_ = std::make_shared<AggregatedPayloads>();
     userInfo = userInfo_;
     serviceName = serviceName_;
@@ -121,7 +121,7 @@ void VRReportingSession::stop() {
     if (self->serviceType_.load() == kTestServiceType) return;
     std::shared_ptr<TelemetrySession> telemetry;
     {
-      std::lock_guard<std::mutex> guard(self->fieldsLock_);
+      MutexLock guard(self->fieldsLock_);
       telemetry = std::move(self->skylarkReportingSession_);
       self->skylarkReportingSession_.reset();
     }
@@ -135,8 +135,8 @@ void VRReportingSession::stop() {
 
   if (auto payloads = aggregatedPayloadData()) {
     // Taken so that no append is half-way while the array is let go.
-    std::lock_guard<std::mutex> arrayGuard(payloads->lock);
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock arrayGuard(payloads->lock);
+    MutexLock guard(fieldsLock_);
     aggregatedPayloadData_.reset();
   }
   started_ = false;
@@ -153,7 +153,7 @@ std::string VRReportingSession::messageIdForCategory(std::uint32_t category, std
   std::int64_t count = 1;
   {
     // Sends from different threads must not lose a count.
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     if (const Value* existing = messageTypeCounts_.find(kind)) count = existing->toInt64().value_or(0) + 1;
     messageTypeCounts_.set(Value(kind), Value(static_cast<long long>(count)));
   }
@@ -247,7 +247,7 @@ void VRReportingSession::keep(AggregatedPayloads& payloads, Value entry) {
   std::size_t dropped;
   bool first;
   {
-    std::lock_guard<std::mutex> guard(payloads.lock);
+    MutexLock guard(payloads.lock);
     dropped = payloads.appendLocked(std::move(entry), budget);
     first = dropped > 0 && payloads.dropped == dropped;
   }
@@ -268,7 +268,7 @@ void VRReportingSession::startBackendSession(const Dictionary& userInfo, const s
 
   std::shared_ptr<HierarchyToken> token = service.makeHierarchyToken();
   {
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     skylarkReportingAgentToken_ = token;
   }
 
@@ -287,7 +287,7 @@ void VRReportingSession::startBackendSession(const Dictionary& userInfo, const s
 
   std::shared_ptr<TelemetrySession> telemetry = service.createSession(sessionInfo, telemetryUserInfo, {});
   {
-    std::lock_guard<std::mutex> guard(fieldsLock_);
+    MutexLock guard(fieldsLock_);
     skylarkReportingSession_ = telemetry;
   }
   if (!telemetry) {
@@ -319,7 +319,7 @@ void VRReportingSession::startBackendSession(const Dictionary& userInfo, const s
                               env_->backendWaitInterval.load(), [self = shared_from_this()](bool ready) {
                                 if (ready) return;
                                 {
-                                  std::lock_guard<std::mutex> guard(self->fieldsLock_);
+                                  MutexLock guard(self->fieldsLock_);
                                   self->skylarkReportingSession_.reset();
                                 }
                                 self->skylarkReportingSessionStarted_ = false;
@@ -373,62 +373,62 @@ void VRReportingSession::sendSingleMessage(const std::shared_ptr<ReportingEnviro
 // ---------------------------------------------------------------- fields
 
 Dictionary VRReportingSession::userInfo() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return userInfo_;
 }
 
 std::shared_ptr<DriverSnapshot> VRReportingSession::driverSnapShot() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return driverSnapShot_;
 }
 
 void VRReportingSession::setDriverSnapShot(std::shared_ptr<DriverSnapshot> snapshot) {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   driverSnapShot_ = std::move(snapshot);
 }
 
 BoolReply VRReportingSession::transactionCompleteBlock() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return transactionCompleteBlock_;
 }
 
 void VRReportingSession::setTransactionCompleteBlock(BoolReply block) {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   transactionCompleteBlock_ = std::move(block);
 }
 
 std::shared_ptr<AggregatedPayloads> VRReportingSession::aggregatedPayloadData() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return aggregatedPayloadData_;
 }
 
 Dictionary VRReportingSession::messageTypeCounts() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return messageTypeCounts_;
 }
 
 std::string VRReportingSession::serviceName() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return serviceName_;
 }
 
 std::optional<std::string> VRReportingSession::orientationCallbackID() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return orientationCallbackID_;
 }
 
 std::optional<WallTime> VRReportingSession::startDate() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return startDate_;
 }
 
 std::shared_ptr<TelemetrySession> VRReportingSession::skylarkReportingSession() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return skylarkReportingSession_;
 }
 
 std::shared_ptr<HierarchyToken> VRReportingSession::skylarkReportingAgentToken() const {
-  std::lock_guard<std::mutex> guard(fieldsLock_);
+  MutexLock guard(fieldsLock_);
   return skylarkReportingAgentToken_;
 }
 

@@ -11,11 +11,11 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "base/mutex.h"
 #include "base/value.h"
 #include "dispatch/dispatch.h"
 #include "drivers/driver_utility.h"
@@ -33,16 +33,16 @@ class ReportingEnvironment;
 // appends to an array nobody reads any more. What is kept is bounded: past the
 // byte budget the oldest entries go first.
 struct AggregatedPayloads {
-  std::mutex lock;
-  std::deque<Value> entries;       // guarded by lock
-  std::deque<std::size_t> sizes;   // guarded by lock: the footprint of each entry
-  std::size_t keptBytes = 0;       // guarded by lock
-  std::uint64_t dropped = 0;       // guarded by lock: entries let go for the budget
+  Mutex lock;
+  std::deque<Value> entries VIREO_GUARDED_BY(lock);
+  std::deque<std::size_t> sizes VIREO_GUARDED_BY(lock);  // the footprint of each entry
+  std::size_t keptBytes VIREO_GUARDED_BY(lock) = 0;
+  std::uint64_t dropped VIREO_GUARDED_BY(lock) = 0;  // entries let go for the budget
 
   // With lock held: appends at the end (or, with front, at the start) and drops the
   // oldest entries while over budget. Returns how many it dropped.
-  std::size_t appendLocked(Value entry, std::size_t budget, bool front = false);
-  Array arrayLocked() const { return Array(entries.begin(), entries.end()); }
+  std::size_t appendLocked(Value entry, std::size_t budget, bool front = false) VIREO_REQUIRES(lock);
+  Array arrayLocked() const VIREO_REQUIRES(lock) { return Array(entries.begin(), entries.end()); }
 };
 
 class VRReportingSession : public std::enable_shared_from_this<VRReportingSession> {
@@ -129,17 +129,17 @@ class VRReportingSession : public std::enable_shared_from_this<VRReportingSessio
 
   // Each field below is read and written whole under fieldsLock_; no lock spans
   // several operations (the server queue orders start, stop and configuration).
-  mutable std::mutex fieldsLock_;
-  Dictionary userInfo_;
-  std::shared_ptr<DriverSnapshot> driverSnapShot_;
-  BoolReply transactionCompleteBlock_;
-  std::shared_ptr<AggregatedPayloads> aggregatedPayloadData_;
-  Dictionary messageTypeCounts_;
-  std::string serviceName_ = "unknown";
-  std::optional<std::string> orientationCallbackID_;
-  std::optional<WallTime> startDate_;
-  std::shared_ptr<TelemetrySession> skylarkReportingSession_;
-  std::shared_ptr<HierarchyToken> skylarkReportingAgentToken_;
+  mutable Mutex fieldsLock_;
+  Dictionary userInfo_ VIREO_GUARDED_BY(fieldsLock_);
+  std::shared_ptr<DriverSnapshot> driverSnapShot_ VIREO_GUARDED_BY(fieldsLock_);
+  BoolReply transactionCompleteBlock_ VIREO_GUARDED_BY(fieldsLock_);
+  std::shared_ptr<AggregatedPayloads> aggregatedPayloadData_ VIREO_GUARDED_BY(fieldsLock_);
+  Dictionary messageTypeCounts_ VIREO_GUARDED_BY(fieldsLock_);
+  std::string serviceName_ VIREO_GUARDED_BY(fieldsLock_) = "unknown";
+  std::optional<std::string> orientationCallbackID_ VIREO_GUARDED_BY(fieldsLock_);
+  std::optional<WallTime> startDate_ VIREO_GUARDED_BY(fieldsLock_);
+  std::shared_ptr<TelemetrySession> skylarkReportingSession_ VIREO_GUARDED_BY(fieldsLock_);
+  std::shared_ptr<HierarchyToken> skylarkReportingAgentToken_ VIREO_GUARDED_BY(fieldsLock_);
 };
 
 }  // namespace vireo

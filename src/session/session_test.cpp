@@ -35,14 +35,14 @@ class SessionTest : public ::testing::Test {
     if (app) s->setConfiguration(&config);
     s->start();
     auto array = s->aggregatedPayloadData();
-    std::lock_guard<std::mutex> guard(array->lock);
+    MutexLock guard(array->lock);
     for (auto& d : payloads) array->appendLocked(Value(std::move(d)), std::numeric_limits<std::size_t>::max());
     return s;
   }
   static Array entries(const VRReportingSession& s) {
     auto payloads = s.aggregatedPayloadData();
     if (!payloads) return {};
-    std::lock_guard<std::mutex> guard(payloads->lock);
+    MutexLock guard(payloads->lock);
     return payloads->arrayLocked();
   }
 

@@ -48,7 +48,7 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
   gathered.push_back({Value(kSummaryKey), {Value(static_cast<unsigned>(serviceType_.load()))}});
   indexOf.set(Value(kSummaryKey), Value(0));
   {
-    std::lock_guard<std::mutex> guard(payloads->lock);
+    MutexLock guard(payloads->lock);
     if (payloads->entries.empty()) return std::nullopt;
     for (const Value& element : payloads->entries) {
       const Dictionary* payload = element.asDictionary();
@@ -80,7 +80,7 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
 
   const Dictionary info = userInfo();
   {
-    std::lock_guard<std::mutex> guard(payloads->lock);
+    MutexLock guard(payloads->lock);
     payloads->appendLocked(Value(info), std::numeric_limits<std::size_t>::max(), true);
   }
 
@@ -94,7 +94,7 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
 
   std::optional<std::string> text;
   {
-    std::lock_guard<std::mutex> guard(payloads->lock);
+    MutexLock guard(payloads->lock);
     JsonError jsonError;
     text = toJson(Value(payloads->arrayLocked()), JsonMode::Strict, true, &jsonError);
     if (!text) error = Error{kGeneralErrorDomain, 0, jsonError.message};

@@ -27,7 +27,7 @@ constexpr double kWaitPollSeconds = 0.5;
 
 std::shared_ptr<const VRReportingBlockThrottleTimerWrapper::Block> VRReportingBlockThrottleTimerWrapper::block()
     const {
-  std::lock_guard guard(blockLock_);
+  MutexLock guard(blockLock_);
   return block_;
 }
 
@@ -37,7 +37,7 @@ void VRReportingBlockThrottleTimerWrapper::setBlock(Block block) {
 
 void VRReportingBlockThrottleTimerWrapper::setBlock(std::shared_ptr<const Block> block) {
   {
-    std::lock_guard guard(blockLock_);
+    MutexLock guard(blockLock_);
     block_.swap(block);
   }
   // The replaced closure is released here, outside the lock: its captures may do anything.
@@ -88,11 +88,11 @@ void VRReportingBlockThrottle::stop() {
     // The worker is gone: nothing will fire the entries left behind.
     std::unordered_map<std::string, std::shared_ptr<Wrapper>> dropped;
     {
-      std::lock_guard guard(timersInFlightLock_);
+      MutexLock guard(timersInFlightLock_);
       dropped.swap(timersInFlight_);
     }
     {
-      std::lock_guard guard(unscheduledTimerKeysLock_);
+      MutexLock guard(unscheduledTimerKeysLock_);
       unscheduledTimerKeys_.clear();
     }
     for (auto& [key, wrapper] : dropped) wrapper->timer().invalidate();
@@ -111,7 +111,7 @@ void VRReportingBlockThrottle::addMessageBlock(Block block, std::int64_t reporte
 
   std::shared_ptr<Wrapper> existing;
   {
-    std::lock_guard guard(timersInFlightLock_);
+    MutexLock guard(timersInFlightLock_);
     if (auto it = timersInFlight_.find(key); it != timersInFlight_.end()) existing = it->second;
   }
   std::shared_ptr<const Block> replacement;
@@ -125,12 +125,12 @@ void VRReportingBlockThrottle::addMessageBlock(Block block, std::int64_t reporte
         clock_, clock_->now() + ThrottleClock::durationFromSeconds(hold),
         [this, key, weak = std::weak_ptr<Wrapper>(wrapper)] { fireEntry(key, weak); }));
     {
-      std::lock_guard guard(timersInFlightLock_);
+      MutexLock guard(timersInFlightLock_);
       auto [it, inserted] = timersInFlight_.try_emplace(key, wrapper);
       if (!inserted) existing = it->second;  // another submitter got there first
     }
     if (!existing) {
-      std::lock_guard guard(unscheduledTimerKeysLock_);
+      MutexLock guard(unscheduledTimerKeysLock_);
       unscheduledTimerKeys_.push_back(std::move(key));
       return;
     }
@@ -162,7 +162,7 @@ void VRReportingBlockThrottle::fireEntry(const std::string& key, const std::weak
   }
   std::shared_ptr<Wrapper> retired;  // released after the lock
   {
-    std::lock_guard guard(timersInFlightLock_);
+    MutexLock guard(timersInFlightLock_);
     if (auto it = timersInFlight_.find(key); it != timersInFlight_.end() && it->second == wrapper) {
       it->second->timer().invalidate();
       retired = std::move(it->second);
@@ -178,7 +178,7 @@ void VRReportingBlockThrottle::runWorker() {
     std::vector<std::string> keys;
     keys.reserve(kUnscheduledCapacity);
     {
-      std::lock_guard guard(unscheduledTimerKeysLock_);
+      MutexLock guard(unscheduledTimerKeysLock_);
       keys.swap(unscheduledTimerKeys_);
     }
     if (!keys.empty()) {
@@ -186,7 +186,7 @@ void VRReportingBlockThrottle::runWorker() {
       // Looked up after the array's lock is released, so the two locks are never
       // held together. No entry can leave in between: only this thread retires them.
       {
-        std::lock_guard guard(timersInFlightLock_);
+        MutexLock guard(timersInFlightLock_);
         for (auto& key : keys) {
           if (auto it = timersInFlight_.find(key); it != timersInFlight_.end())
             attached.push_back({it->second->timer().fireDate(), std::move(key), it->second});
@@ -262,22 +262,22 @@ void VRReportingBlockThrottle::waitForCompletion() {
 
 std::unordered_map<std::string, std::shared_ptr<VRReportingBlockThrottleTimerWrapper>>
 VRReportingBlockThrottle::timersInFlight() const {
-  std::lock_guard guard(timersInFlightLock_);
+  MutexLock guard(timersInFlightLock_);
   return timersInFlight_;
 }
 
 std::vector<std::string> VRReportingBlockThrottle::unscheduledTimerKeys() const {
-  std::lock_guard guard(unscheduledTimerKeysLock_);
+  MutexLock guard(unscheduledTimerKeysLock_);
   return unscheduledTimerKeys_;
 }
 
 std::size_t VRReportingBlockThrottle::timersInFlightCount() const {
-  std::lock_guard guard(timersInFlightLock_);
+  MutexLock guard(timersInFlightLock_);
   return timersInFlight_.size();
 }
 
 std::size_t VRReportingBlockThrottle::unscheduledTimerKeysCount() const {
-  std::lock_guard guard(unscheduledTimerKeysLock_);
+  MutexLock guard(unscheduledTimerKeysLock_);
   return unscheduledTimerKeys_.size();
 }
 

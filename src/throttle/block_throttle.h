@@ -8,7 +8,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <span>
 #include <string>
 #include <string_view>
@@ -16,6 +15,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "base/mutex.h"
 #include "base/value.h"
 #include "platform/logger.h"
 #include "throttle/throttle_clock.h"
@@ -63,8 +63,8 @@ class VRReportingBlockThrottleTimerWrapper {
   void sleepFor(double seconds);
 
  private:
-  mutable std::mutex blockLock_;  // guards block_: duplicates replace it while the worker reads it
-  std::shared_ptr<const Block> block_;
+  mutable Mutex blockLock_;  // guards block_: duplicates replace it while the worker reads it
+  std::shared_ptr<const Block> block_ VIREO_GUARDED_BY(blockLock_);
   std::unique_ptr<ThrottleTimer> timer_;
 };
 
@@ -140,10 +140,10 @@ class VRReportingBlockThrottle {
   // worker's ordering by armed date would otherwise miss.
   std::atomic<bool> fireDateMovedEarlier_{false};
 
-  mutable std::mutex timersInFlightLock_;  // guards timersInFlight_ (every read and write)
-  std::unordered_map<std::string, std::shared_ptr<Wrapper>> timersInFlight_;
-  mutable std::mutex unscheduledTimerKeysLock_;  // guards unscheduledTimerKeys_; never held with the one above
-  std::vector<std::string> unscheduledTimerKeys_;
+  mutable Mutex timersInFlightLock_;  // guards timersInFlight_ (every read and write)
+  std::unordered_map<std::string, std::shared_ptr<Wrapper>> timersInFlight_ VIREO_GUARDED_BY(timersInFlightLock_);
+  mutable Mutex unscheduledTimerKeysLock_;  // guards unscheduledTimerKeys_; never held with the one above
+  std::vector<std::string> unscheduledTimerKeys_ VIREO_GUARDED_BY(unscheduledTimerKeysLock_);
 
   std::thread queueThread_;  // written by make() before the throttle is shared, joined by stop()
   std::thread::id queueThreadID_;

@@ -8,8 +8,8 @@
 #include <atomic>
 #include <condition_variable>
 #include <list>
-#include <mutex>
 
+#include "base/mutex.h"
 #include "throttle/throttle_clock.h"
 
 namespace vireo {
@@ -20,7 +20,7 @@ class SimulatedThrottleClock final : public ThrottleClock {
   explicit SimulatedThrottleClock(int participants = 1) : participants_(participants) {}
 
   TimePoint now() const override {
-    std::lock_guard guard(lock_);
+    MutexLock guard(lock_);
     return now_;
   }
 
@@ -28,26 +28,26 @@ class SimulatedThrottleClock final : public ThrottleClock {
   double seconds() const { return std::chrono::duration<double>(now().time_since_epoch()).count(); }
 
   void sleepUntil(TimePoint deadline, const std::atomic<bool>* interrupt) override {
-    std::unique_lock guard(lock_);
+    MutexLock guard(lock_);
     auto me = sleepers_.insert(sleepers_.end(), Sleeper{deadline, interrupt});
     while (now_ < deadline && !(interrupt && interrupt->load())) {
-      if (!advanceIfAllAsleep()) changed_.wait(guard);
+      if (!advanceIfAllAsleep()) guard.wait(changed_);
     }
     sleepers_.erase(me);
   }
 
   void wake() override {
-    { std::lock_guard guard(lock_); }
+    { MutexLock guard(lock_); }
     changed_.notify_all();
   }
 
   void threadJoins() override {
-    std::lock_guard guard(lock_);
+    MutexLock guard(lock_);
     ++participants_;
   }
 
   void threadLeaves() override {
-    std::lock_guard guard(lock_);
+    MutexLock guard(lock_);
     --participants_;
     advanceIfAllAsleep();
   }
@@ -60,7 +60,7 @@ class SimulatedThrottleClock final : public ThrottleClock {
 
   // Called with lock_ held; true when time moved. It stays put while a sleeper is
   // already due or has its interrupt raised: that thread is about to wake.
-  bool advanceIfAllAsleep() {
+  bool advanceIfAllAsleep() VIREO_REQUIRES(lock_) {
     if (sleepers_.empty() || static_cast<int>(sleepers_.size()) < participants_) return false;
     for (const auto& s : sleepers_)
       if (s.interrupt && s.interrupt->load()) return false;
@@ -72,11 +72,11 @@ class SimulatedThrottleClock final : public ThrottleClock {
     return true;
   }
 
-  mutable std::mutex lock_;  // guards now_, sleepers_ and participants_
+  mutable Mutex lock_;  // guards now_, sleepers_ and participants_
   std::condition_variable changed_;
-  TimePoint now_{};
-  std::list<Sleeper> sleepers_;
-  int participants_;
+  TimePoint now_ VIREO_GUARDED_BY(lock_){};
+  std::list<Sleeper> sleepers_ VIREO_GUARDED_BY(lock_);
+  int participants_ VIREO_GUARDED_BY(lock_);
 };
 
 }  // namespace vireo

@@ -12,12 +12,13 @@ ThrottleClock::Duration ThrottleClock::durationFromSeconds(double seconds) {
 }
 
 void SteadyThrottleClock::sleepUntil(TimePoint deadline, const std::atomic<bool>* interrupt) {
-  std::unique_lock guard(lock_);
-  woken_.wait_until(guard, deadline, [&] { return interrupt && interrupt->load(); });
+  MutexLock guard(lock_);
+  while (!(interrupt && interrupt->load()))
+    if (guard.waitUntil(woken_, deadline) == std::cv_status::timeout) break;
 }
 
 void SteadyThrottleClock::wake() {
-  { std::lock_guard guard(lock_); }
+  { MutexLock guard(lock_); }
   woken_.notify_all();
 }
 

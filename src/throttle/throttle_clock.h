@@ -6,7 +6,8 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
-#include <mutex>
+
+#include "base/mutex.h"
 
 namespace vireo {
 
@@ -42,7 +43,7 @@ class SteadyThrottleClock final : public ThrottleClock {
   void wake() override;
 
  private:
-  std::mutex lock_;  // pairs with woken_ so that a wake cannot slip between a sleeper's check and its wait
+  Mutex lock_;  // pairs with woken_ so that a wake cannot slip between a sleeper's check and its wait
   std::condition_variable woken_;
 };
 

@@ -90,7 +90,7 @@ class ReportingWaiter : public std::enable_shared_from_this<ReportingWaiter> {
 
   void begin() {
     {
-      std::lock_guard<std::mutex> lock(condition_->lock_);
+      MutexLock lock(condition_->lock_);
       if (!condition_->done_) return parkLocked();
     }
     finish(true);
@@ -100,7 +100,7 @@ class ReportingWaiter : public std::enable_shared_from_this<ReportingWaiter> {
   // next park, so no signal falls in between.
   void woken() {
     {
-      std::lock_guard<std::mutex> lock(condition_->lock_);
+      MutexLock lock(condition_->lock_);
       VR_LOG(logger_, where_, LogLevel::Default, kLabel, "continuing");
       if (!condition_->done_) return parkLocked();
       condition_->waiter_.reset();
@@ -112,7 +112,7 @@ class ReportingWaiter : public std::enable_shared_from_this<ReportingWaiter> {
   void timedOut() {
     std::shared_ptr<Parking> spent;
     {
-      std::lock_guard<std::mutex> lock(condition_->lock_);
+      MutexLock lock(condition_->lock_);
       condition_->waiter_.reset();
       spent = std::move(condition_->parking_);
       VR_LOG(logger_, where_, LogLevel::Error, kLabel, "%s", giveUpText_.c_str());
@@ -124,7 +124,7 @@ class ReportingWaiter : public std::enable_shared_from_this<ReportingWaiter> {
   static constexpr const char* kLabel = "VRReportingUtilityWait";
 
   // With condition_->lock_ held: one round of waiting.
-  void parkLocked() {
+  void parkLocked() VIREO_REQUIRES(condition_->lock_) {
     VR_LOG(logger_, where_, LogLevel::Default, kLabel, "%s", waitText_.c_str());
     condition_->waiter_ = weak_from_this();
     condition_->parking_ = queue_->park(span_, [self = shared_from_this()] { self->timedOut(); });
@@ -147,7 +147,7 @@ class ReportingWaiter : public std::enable_shared_from_this<ReportingWaiter> {
 };
 
 bool ReportingCondition::done() const {
-  std::lock_guard<std::mutex> lock(lock_);
+  MutexLock lock(lock_);
   return done_;
 }
 
@@ -155,7 +155,7 @@ void ReportingCondition::wake(bool setDone) {
   std::shared_ptr<ReportingWaiter> waiter;
   std::shared_ptr<Parking> parking;
   {
-    std::lock_guard<std::mutex> lock(lock_);
+    MutexLock lock(lock_);
     if (setDone) done_ = true;
     waiter = waiter_.lock();
     parking = std::move(parking_);  // one wake-up per round

@@ -6,11 +6,11 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 
+#include "base/mutex.h"
 #include "base/value.h"
 #include "dispatch/dispatch.h"
 #include "platform/logger.h"
@@ -55,10 +55,10 @@ class ReportingCondition {
   friend class ReportingWaiter;
   void wake(bool setDone);
 
-  mutable std::mutex lock_;  // guards done_, waiter_ and parking_
-  bool done_;
-  std::weak_ptr<ReportingWaiter> waiter_;  // the wait in progress, if any
-  std::shared_ptr<Parking> parking_;       // its queue's current park, while it waits
+  mutable Mutex lock_;  // guards done_, waiter_ and parking_
+  bool done_ VIREO_GUARDED_BY(lock_);
+  std::weak_ptr<ReportingWaiter> waiter_ VIREO_GUARDED_BY(lock_);  // the wait in progress, if any
+  std::shared_ptr<Parking> parking_ VIREO_GUARDED_BY(lock_);       // its queue's current park, while it waits
 };
 
 // Waits until the condition is done, allowing interval seconds of silence between

@@ -223,7 +223,7 @@ DriverSubscriptionHandle StatsTreeLibrary::createSubscription(const DriverChanne
     *subscribed = std::make_unique<TreeSubscribedChannels>(std::make_shared<const ChannelList>(set->channels));
   auto subscription = std::make_unique<Subscription>();
   subscription->channelCount = set->channels.size();
-  std::lock_guard lock(subscriptionsLock_);
+  MutexLock lock(subscriptionsLock_);
   subscriptions_.push_back(std::move(subscription));
   return subscriptions_.back().get();
 }

@@ -10,12 +10,12 @@
 
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "base/mutex.h"
 #include "platform/driver_stats.h"
 
 namespace vireo::linux_platform {
@@ -71,8 +71,8 @@ class StatsTreeLibrary final : public DriverStatsLibrary {
 
   // Guards subscriptions_. Entries are never removed: their addresses are the
   // subscription handles, which live as long as the library.
-  std::mutex subscriptionsLock_;
-  std::vector<std::unique_ptr<Subscription>> subscriptions_;
+  Mutex subscriptionsLock_;
+  std::vector<std::unique_ptr<Subscription>> subscriptions_ VIREO_GUARDED_BY(subscriptionsLock_);
 };
 
 }  // namespace vireo::linux_platform

@@ -17,7 +17,7 @@ SystemRandom::SystemRandom() : engine_(seededEngine()) {}
 std::uint32_t SystemRandom::uniformBelow(std::uint32_t bound) {
   if (bound <= 1) return 0;
   std::uniform_int_distribution<std::uint32_t> distribution(0, bound - 1);
-  std::lock_guard lock(mu_);
+  MutexLock lock(mu_);
   return distribution(engine_);
 }
 

@@ -1,9 +1,9 @@
 // The real clock and a thread-safe random source.
 #pragma once
 
-#include <mutex>
 #include <random>
 
+#include "base/mutex.h"
 #include "platform/clock.h"
 
 namespace vireo::linux_platform {
@@ -19,8 +19,8 @@ class SystemRandom : public RandomSource {
   std::uint32_t uniformBelow(std::uint32_t bound) override;
 
  private:
-  std::mutex mu_;  // guards engine_
-  std::mt19937 engine_;
+  Mutex mu_;  // guards engine_
+  std::mt19937 engine_ VIREO_GUARDED_BY(mu_);
 };
 
 }  // namespace vireo::linux_platform

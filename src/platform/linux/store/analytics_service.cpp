@@ -18,13 +18,13 @@ void LocalAnalyticsService::reload() {
   if (auto file = readKeyFile(configurationDirectory_ + "/analytics.conf")) {
     if (auto it = file->find("Exclude"); it != file->end()) patterns = splitList(it->second);
   }
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   exclude_ = std::move(patterns);
 }
 
 bool LocalAnalyticsService::wants(std::string_view name) const {
   const std::string text(name);
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   for (const auto& pattern : exclude_) {
     if (::fnmatch(pattern.c_str(), text.c_str(), 0) == 0) return false;
   }

@@ -3,11 +3,11 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "base/mutex.h"
 #include "platform/event_sinks.h"
 #include "platform/linux/store/store.h"
 
@@ -27,8 +27,8 @@ class LocalAnalyticsService : public AnalyticsService {
  private:
   const std::shared_ptr<LocalStore> store_;
   const std::string configurationDirectory_;
-  mutable std::mutex mutex_;  // guards exclude_
-  std::vector<std::string> exclude_;
+  mutable Mutex mutex_;  // guards exclude_
+  std::vector<std::string> exclude_ VIREO_GUARDED_BY(mutex_);
 };
 
 }  // namespace vireo::linux_platform

@@ -2,24 +2,25 @@
 
 #include <condition_variable>
 #include <deque>
-#include <mutex>
 #include <utility>
+
+#include "base/mutex.h"
 
 namespace vireo::linux_platform {
 
 // Shared with the thread itself so that it may outlive its owner.
 struct CompletionThread::State {
-  std::mutex mutex;  // guards queue and stop
+  Mutex mutex;  // guards queue and stop
   std::condition_variable wake;
-  std::deque<std::function<void()>> queue;
-  bool stop = false;
+  std::deque<std::function<void()>> queue VIREO_GUARDED_BY(mutex);
+  bool stop VIREO_GUARDED_BY(mutex) = false;
 };
 
 CompletionThread::CompletionThread() : state_(std::make_shared<State>()) {
   thread_ = std::thread([state = state_] {
-    std::unique_lock lock(state->mutex);
+    MutexLock lock(state->mutex);
     for (;;) {
-      state->wake.wait(lock, [&] { return state->stop || !state->queue.empty(); });
+      while (!state->stop && state->queue.empty()) lock.wait(state->wake);
       if (state->queue.empty()) return;
       auto work = std::move(state->queue.front());
       state->queue.pop_front();
@@ -37,7 +38,7 @@ CompletionThread::CompletionThread() : state_(std::make_shared<State>()) {
 
 CompletionThread::~CompletionThread() {
   {
-    std::lock_guard lock(state_->mutex);
+    MutexLock lock(state_->mutex);
     state_->stop = true;
   }
   state_->wake.notify_all();
@@ -50,7 +51,7 @@ CompletionThread::~CompletionThread() {
 
 void CompletionThread::post(std::function<void()> work) {
   {
-    std::lock_guard lock(state_->mutex);
+    MutexLock lock(state_->mutex);
     state_->queue.push_back(std::move(work));
   }
   state_->wake.notify_one();

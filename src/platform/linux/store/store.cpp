@@ -225,7 +225,7 @@ std::string LocalStore::jsonObject(const Dictionary& d) {
 }
 
 bool LocalStore::refuse() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   ++refusedRows_;
   return false;
 }
@@ -238,7 +238,7 @@ bool LocalStore::enqueue(Row&& row) {
   std::uint64_t rows = 0;
   std::uint64_t bytes = 0;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (stopping_) {
       ++refusedRows_;
       return false;
@@ -347,26 +347,28 @@ bool LocalStore::insertEnergyEvent(std::int64_t client, std::string_view name, c
 }
 
 std::uint64_t LocalStore::handedOver() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return enqueued_;
 }
 
 bool LocalStore::flush(std::chrono::milliseconds timeout, std::uint64_t since) {
   if (!usable()) return false;
-  std::unique_lock lock(mutex_);
+  MutexLock lock(mutex_);
   const std::uint64_t target = enqueued_;
-  if (!processed_.wait_for(lock, timeout, [&] { return processedRows_ >= target; })) return false;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (processedRows_ < target)
+    if (lock.waitUntil(processed_, deadline) == std::cv_status::timeout && processedRows_ < target) return false;
   return !droppedAfter(since, target);
 }
 
 StoreStatus LocalStore::status() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return StoreStatus{pendingRows_, pendingBytes_, refusedRows_, droppedBadRows_, writeErrors_, lastError_, usable()};
 }
 
 void LocalStore::close() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (closed_) return;
     closed_ = true;
     stopping_ = true;
@@ -420,14 +422,16 @@ void LocalStore::writerLoop() {
   std::string badError;        // why the first of the batch's bad rows was refused
   std::uint64_t failures = 0;  // consecutive failed attempts
   std::chrono::milliseconds delay{0};
-  std::unique_lock lock(mutex_);
+  MutexLock lock(mutex_);
   for (;;) {
     if (failures == 0) {
-      wake_.wait(lock, [&] { return stopping_ || !queue_.empty(); });
+      while (!stopping_ && queue_.empty()) lock.wait(wake_);
     } else {
       // Only close() cuts the pause short, for one attempt at once.
       const bool wasStopping = stopping_;
-      wake_.wait_for(lock, delay, [&] { return stopping_ != wasStopping; });
+      const auto until = std::chrono::steady_clock::now() + delay;
+      while (stopping_ == wasStopping && lock.waitUntil(wake_, until) == std::cv_status::no_timeout) {
+      }
     }
     if (batch.empty()) {
       batch.swap(queue_);

@@ -15,7 +15,6 @@
 #include <condition_variable>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -23,6 +22,7 @@
 #include <utility>
 #include <vector>
 
+#include "base/mutex.h"
 #include "base/value.h"
 #include "platform/clock.h"
 #include "platform/logger.h"
@@ -119,9 +119,9 @@ class LocalStore {
   void writerLoop();
   bool writeBatch(std::vector<Row>& batch, std::string* error, std::string* badError);
   int writeRow(const Row& row, std::string* error);
-  void finishBatch(std::vector<Row>& batch, bool dropAll);
-  void noteDropped(std::uint64_t first, std::uint64_t last);
-  bool droppedAfter(std::uint64_t since, std::uint64_t upTo) const;
+  void finishBatch(std::vector<Row>& batch, bool dropAll) VIREO_REQUIRES(mutex_);
+  void noteDropped(std::uint64_t first, std::uint64_t last) VIREO_REQUIRES(mutex_);
+  bool droppedAfter(std::uint64_t since, std::uint64_t upTo) const VIREO_REQUIRES(mutex_);
   bool exec(const char* sql);
   void logError(const char* function, const char* what);
   void finalizeDatabase();
@@ -140,24 +140,24 @@ class LocalStore {
   // mutex_ guards the queue and everything below it down to the writer thread.
   // Rows are numbered from 1 in the order they are handed over and processed
   // (committed or dropped) in that order.
-  mutable std::mutex mutex_;
+  mutable Mutex mutex_;
   std::condition_variable wake_;      // the writer: rows, stop
   std::condition_variable processed_; // flush() waiters
-  std::vector<Row> queue_;            // not yet taken by the writer
-  std::uint64_t pendingRows_ = 0;     // queue_ and the writer's batch
-  std::uint64_t pendingBytes_ = 0;
-  std::uint64_t enqueued_ = 0;        // rows handed over, ever
-  std::uint64_t processedRows_ = 0;   // rows committed or dropped, ever
-  std::vector<std::pair<std::uint64_t, std::uint64_t>> dropped_;  // recent ranges of dropped row numbers
-  std::uint64_t forgottenDrops_ = 0;  // the last row number of ranges no longer in dropped_
-  std::uint64_t refusedRows_ = 0;
-  std::uint64_t droppedBadRows_ = 0;
-  std::uint64_t writeErrors_ = 0;
-  std::string lastError_;
-  bool overflowing_ = false;  // refusing since the queue last went below half its limits
-  bool stopping_ = false;
-  bool closed_ = false;
-  std::chrono::steady_clock::time_point giveUpAt_{};  // set by close()
+  std::vector<Row> queue_ VIREO_GUARDED_BY(mutex_);            // not yet taken by the writer
+  std::uint64_t pendingRows_ VIREO_GUARDED_BY(mutex_) = 0;     // queue_ and the writer's batch
+  std::uint64_t pendingBytes_ VIREO_GUARDED_BY(mutex_) = 0;
+  std::uint64_t enqueued_ VIREO_GUARDED_BY(mutex_) = 0;        // rows handed over, ever
+  std::uint64_t processedRows_ VIREO_GUARDED_BY(mutex_) = 0;   // rows committed or dropped, ever
+  std::vector<std::pair<std::uint64_t, std::uint64_t>> dropped_ VIREO_GUARDED_BY(mutex_);  // recent ranges of dropped row numbers
+  std::uint64_t forgottenDrops_ VIREO_GUARDED_BY(mutex_) = 0;  // the last row number of ranges no longer in dropped_
+  std::uint64_t refusedRows_ VIREO_GUARDED_BY(mutex_) = 0;
+  std::uint64_t droppedBadRows_ VIREO_GUARDED_BY(mutex_) = 0;
+  std::uint64_t writeErrors_ VIREO_GUARDED_BY(mutex_) = 0;
+  std::string lastError_ VIREO_GUARDED_BY(mutex_);
+  bool overflowing_ VIREO_GUARDED_BY(mutex_) = false;  // refusing since the queue last went below half its limits
+  bool stopping_ VIREO_GUARDED_BY(mutex_) = false;
+  bool closed_ VIREO_GUARDED_BY(mutex_) = false;
+  std::chrono::steady_clock::time_point giveUpAt_ VIREO_GUARDED_BY(mutex_){};  // set by close()
   std::thread writer_;
 };
 
