@@ -32,6 +32,18 @@ void BusMailbox::post(Task task) {
   task();
 }
 
+void BusMailbox::runOrPost(Task task) {
+  if (owner_.load(std::memory_order_acquire) == std::this_thread::get_id()) {
+    bool idle;
+    {
+      MutexLock lock(mutex_);
+      idle = !closed_ && tasks_.empty();
+    }
+    if (idle) return task();
+  }
+  post(std::move(task));
+}
+
 void BusMailbox::drain() {
   std::uint64_t count = 0;
   if (fd_ >= 0 && read(fd_, &count, sizeof count) < 0) {

@@ -8,7 +8,9 @@
 // (dropping late replies, the final close) serialised.
 #pragma once
 
+#include <atomic>
 #include <functional>
+#include <thread>
 #include <vector>
 
 #include "base/mutex.h"
@@ -27,6 +29,11 @@ class BusMailbox {
   // Readable when tasks wait; -1 when no eventfd could be made.
   int fd() const { return fd_; }
   void post(Task task);
+  // The bus thread calls this before it runs its loop.
+  void bindToCurrentThread() { owner_.store(std::this_thread::get_id(), std::memory_order_release); }
+  // On the bus thread with nothing queued ahead (so the posting order holds), runs the
+  // task at once, saving a wake-up of the loop; anywhere else it posts it.
+  void runOrPost(Task task);
   // On the bus thread: runs the queued tasks.
   void drain();
   // From now on tasks run on the posting thread; runs those still queued.
@@ -37,6 +44,7 @@ class BusMailbox {
   Mutex mutex_;  // guards tasks_ and closed_
   std::vector<Task> tasks_ VIREO_GUARDED_BY(mutex_);
   bool closed_ VIREO_GUARDED_BY(mutex_) = false;
+  std::atomic<std::thread::id> owner_{};
   RecursiveMutex inlineMutex_ VIREO_ACQUIRED_BEFORE(mutex_);  // serialises tasks run after close()
 };
 

@@ -329,10 +329,12 @@ const sd_bus_vtable kOrientationVtable[] = {
 
 }  // namespace
 
-BusService::BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications)
+BusService::BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications,
+                       std::shared_ptr<BusMailbox> mailbox)
     : logger_(logger),
       notifications_(notifications),
-      registry_(delegate, [this](const std::string& name) { lookupCredentials(name); }) {}
+      registry_(delegate, [this](const std::string& name) { lookupCredentials(name); }),
+      mailbox_(std::move(mailbox)) {}
 
 BusService::~BusService() {
   stop();
@@ -429,6 +431,7 @@ int BusService::open(const Options& options) {
 
 int BusService::run() {
   if (!event_) return -ENOTCONN;
+  mailbox_->bindToCurrentThread();
   int r = sd_event_loop(event_.get());
   if (r != 0)
     VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "BusService::run", "the bus loop ended: %s",

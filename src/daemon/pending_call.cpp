@@ -30,12 +30,12 @@ PendingCall::PendingCall(std::shared_ptr<BusMailbox> mailbox, sd_bus_message* ca
 
 PendingCall::~PendingCall() {
   // Posted after any answer, so the answer still finds the message.
-  mailbox_->post([call = call_] { sd_bus_message_unref(call); });
+  mailbox_->runOrPost([call = call_] { sd_bus_message_unref(call); });
 }
 
 bool PendingCall::answer(Reply reply) {
   if (answered_.exchange(true)) return false;
-  mailbox_->post([call = call_, reply = std::move(reply)] { send(call, reply); });
+  mailbox_->runOrPost([call = call_, reply = std::move(reply)] { send(call, reply); });
   return true;
 }
 
