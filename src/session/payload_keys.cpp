@@ -2,6 +2,8 @@
 
 #include <string>
 
+#include "base/value_pack.h"
+
 namespace vireo {
 
 Dictionary cleanPayloadKeys(const Dictionary& payload) {
@@ -22,16 +24,9 @@ Dictionary cleanPayloadKeys(const Dictionary& payload) {
 }
 
 std::size_t payloadFootprint(const Value& value) {
-  // Each node's own bookkeeping (value slot, container header, allocation) is about 32 bytes.
-  constexpr std::size_t kNode = 32;
-  if (const std::string* s = value.asString()) return kNode + s->size();
-  if (const Data* d = value.asData()) return kNode + d->size();
-  std::size_t total = kNode;
-  if (const Array* a = value.asArray())
-    for (const Value& v : *a) total += payloadFootprint(v);
-  if (const Dictionary* d = value.asDictionary())
-    for (const auto& [k, v] : *d) total += payloadFootprint(k) + payloadFootprint(v);
-  return total;
+  std::string packed = packValue(value);
+  packed.shrink_to_fit();
+  return packedFootprint(packed);
 }
 
 }  // namespace vireo

@@ -10,7 +10,7 @@ namespace vireo {
 // text, the later entry wins.
 Dictionary cleanPayloadKeys(const Dictionary& payload);
 
-// About what a value costs to keep in memory, in bytes; linear in its size.
+// What a value costs to keep packed in memory, in bytes; linear in its size.
 std::size_t payloadFootprint(const Value& value);
 
 }  // namespace vireo

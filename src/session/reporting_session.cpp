@@ -18,6 +18,8 @@ constexpr std::uint16_t kTestServiceType = 11;
 constexpr const char* kClientName = "com.orvane.vireo";
 constexpr std::int64_t kClientType = 19;
 constexpr double kClientVersion = 2.0;
+// Kept payload bytes past which a stop hands freed memory back to the system.
+constexpr std::size_t kReleaseMemoryAfterBytes = 1 << 20;
 
 }  // namespace
 
@@ -133,13 +135,19 @@ void VRReportingSession::stop() {
     });
   });
 
+  std::size_t released = 0;
   if (auto payloads = aggregatedPayloadData()) {
     // Taken so that no append is half-way while the array is let go.
     MutexLock arrayGuard(payloads->lock);
     MutexLock guard(fieldsLock_);
+    released = payloads->keptBytes;
     aggregatedPayloadData_.reset();
   }
   started_ = false;
+  // A large summary leaves free memory behind; once it is gone, give it back.
+  if (released >= kReleaseMemoryAfterBytes)
+    env_->platform.dispatcher.asyncLowPriority(std::chrono::nanoseconds::zero(),
+                                               [env = env_] { env->platform.process.releaseFreeMemory(); });
 
   // Every started session was given a callback by its server instance; a missing one
   // must still not bring the daemon down.
@@ -220,22 +228,20 @@ void VRReportingSession::deliver(const Dictionary& cleaned, const Value& receive
   }
 }
 
-std::size_t AggregatedPayloads::appendLocked(Value entry, std::size_t budget, bool front) {
-  const std::size_t bytes = payloadFootprint(entry);
+std::size_t AggregatedPayloads::appendLocked(const Value& entry, std::size_t budget, bool front) {
+  std::string packed = packValue(entry);
+  packed.shrink_to_fit();
+  keptBytes += packedFootprint(packed);
   if (front) {
-    entries.push_front(std::move(entry));
-    sizes.push_front(bytes);
+    entries.push_front(std::move(packed));
   } else {
-    entries.push_back(std::move(entry));
-    sizes.push_back(bytes);
+    entries.push_back(std::move(packed));
   }
-  keptBytes += bytes;
   std::size_t droppedNow = 0;
   // The newest entry always stays, however big.
   while (keptBytes > budget && entries.size() > 1) {
-    keptBytes -= sizes.front();
+    keptBytes -= packedFootprint(entries.front());
     entries.pop_front();
-    sizes.pop_front();
     ++droppedNow;
   }
   dropped += droppedNow;

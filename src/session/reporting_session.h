@@ -17,6 +17,7 @@
 
 #include "base/mutex.h"
 #include "base/value.h"
+#include "base/value_pack.h"
 #include "dispatch/dispatch.h"
 #include "drivers/driver_utility.h"
 #include "platform/clock.h"
@@ -31,18 +32,31 @@ class ReportingEnvironment;
 // The gathered payloads of a running session with the lock that guards them. Each
 // start makes a new one; stop drops it, so a sender that still holds the old one
 // appends to an array nobody reads any more. What is kept is bounded: past the
-// byte budget the oldest entries go first.
+// byte budget the oldest entries go first. Entries are kept packed (value_pack.h),
+// at about their JSON size, and unpacked once, for the summary.
 struct AggregatedPayloads {
   Mutex lock;
-  std::deque<Value> entries VIREO_GUARDED_BY(lock);
-  std::deque<std::size_t> sizes VIREO_GUARDED_BY(lock);  // the footprint of each entry
+  std::deque<std::string> entries VIREO_GUARDED_BY(lock);  // packed
   std::size_t keptBytes VIREO_GUARDED_BY(lock) = 0;
   std::uint64_t dropped VIREO_GUARDED_BY(lock) = 0;  // entries let go for the budget
 
   // With lock held: appends at the end (or, with front, at the start) and drops the
   // oldest entries while over budget. Returns how many it dropped.
-  std::size_t appendLocked(Value entry, std::size_t budget, bool front = false) VIREO_REQUIRES(lock);
-  Array arrayLocked() const VIREO_REQUIRES(lock) { return Array(entries.begin(), entries.end()); }
+  std::size_t appendLocked(const Value& entry, std::size_t budget, bool front = false) VIREO_REQUIRES(lock);
+  // Calls f with each entry, unpacked, oldest first.
+  template <typename F>
+  void forEachLocked(F&& f) const VIREO_REQUIRES(lock) {
+    for (const std::string& packed : entries) {
+      std::string_view in = packed;
+      if (auto value = unpackValue(in)) f(*value);
+    }
+  }
+  Array arrayLocked() const VIREO_REQUIRES(lock) {
+    Array array;
+    array.reserve(entries.size());
+    forEachLocked([&](Value& v) { array.push_back(std::move(v)); });
+    return array;
+  }
 };
 
 class VRReportingSession : public std::enable_shared_from_this<VRReportingSession> {

@@ -50,9 +50,9 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
   {
     MutexLock guard(payloads->lock);
     if (payloads->entries.empty()) return std::nullopt;
-    for (const Value& element : payloads->entries) {
+    payloads->forEachLocked([&](const Value& element) {
       const Dictionary* payload = element.asDictionary();
-      if (!payload) continue;
+      if (!payload) return;
       for (const auto& [key, value] : *payload) {
         std::size_t slot;
         if (const Value* found = indexOf.find(key)) {
@@ -64,7 +64,7 @@ std::optional<Dictionary> VRReportingSession::createSummaryEventForSession() {
         }
         gathered[slot].second.push_back(value);
       }
-    }
+    });
   }
 
   Dictionary result;
