@@ -329,12 +329,10 @@ const sd_bus_vtable kOrientationVtable[] = {
 
 }  // namespace
 
-BusService::BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications,
-                       std::shared_ptr<BusMailbox> mailbox)
+BusService::BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications)
     : logger_(logger),
       notifications_(notifications),
-      registry_(delegate, [this](const std::string& name) { lookupCredentials(name); }),
-      mailbox_(std::move(mailbox)) {}
+      registry_(delegate, [this](const std::string& name) { lookupCredentials(name); }) {}
 
 BusService::~BusService() {
   stop();

@@ -73,9 +73,7 @@ class BusService {
     std::function<Dictionary()> status;
   };
 
-  // mailbox: the bus thread's; pass one to share it with a BusThreadQueue made beforehand.
-  BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications,
-             std::shared_ptr<BusMailbox> mailbox = std::make_shared<BusMailbox>());
+  BusService(Logger& logger, ListenerDelegate& delegate, NotificationCenter& notifications);
   ~BusService();  // stops, joins and closes
   BusService(const BusService&) = delete;
   BusService& operator=(const BusService&) = delete;
@@ -125,7 +123,7 @@ class BusService {
   Logger& logger_;
   NotificationCenter& notifications_;
   ClientRegistry registry_;                  // bus thread only
-  const std::shared_ptr<BusMailbox> mailbox_;
+  std::shared_ptr<BusMailbox> mailbox_ = std::make_shared<BusMailbox>();
   // The sd-bus and sd-event objects below belong to the bus thread while the loop
   // runs, and to close() (through the closed mailbox) after it.
   dbus::BusRef bus_;

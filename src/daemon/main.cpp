@@ -15,7 +15,6 @@
 
 #include "daemon/bus_choice.h"
 #include "daemon/bus_service.h"
-#include "daemon/bus_thread_queue.h"
 #include "daemon/notification_center.h"
 #include "daemon/orientation_service.h"
 #include "dispatch/thread_pool.h"
@@ -168,16 +167,13 @@ int main(int argc, char** argv) {
 
   auto environment = std::make_shared<ReportingEnvironment>(platform);
   environment->maxKeptBytesPerSession = limits.maxKeptBytesPerSession;
-  // The server queue runs on the bus thread, where the calls it answers arrive.
-  auto mailbox = std::make_shared<daemon::BusMailbox>();
-  auto delegate = VRReportingServiceDelegate::init(
-      environment, daemon::BusThreadQueue::make(mailbox, kServerQueueLabel, *logger));
+  auto delegate = VRReportingServiceDelegate::init(environment);
   if (!delegate) {
     VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Error, "main", "the service could not be initialised");
     return finish(1);
   }
 
-  daemon::BusService service(*logger, *delegate, notifications, mailbox);
+  daemon::BusService service(*logger, *delegate, notifications);
   daemon::BusService::Options options;
   options.interfaceOrientation = [&orientation](Orientation o) { orientation.pushInterfaceOrientation(o); };
   options.limits = limits;

@@ -35,6 +35,10 @@ class SerialQueue {
   virtual ~SerialQueue() = default;
   // Submits without waiting.
   virtual void async(Task task) = 0;
+  // When the queue is idle (nothing queued or running, not parked), runs task at once
+  // on the calling thread, in its place in the queue's order; otherwise as async. For
+  // short closures whose caller would otherwise wait for a hand-off to another thread.
+  virtual void asyncOrRun(Task task) { async(std::move(task)); }
   virtual const std::string& label() const = 0;
   // Parks the queue: once the closure running on it returns (at once if none is
   // running), the queue runs nothing more, and holds no thread, until the returned

@@ -156,6 +156,30 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
     if (schedule) core_->submitQueue(shared_from_this(), qos_);
   }
 
+  void asyncOrRun(Task task) override {
+    if (!task || core_->stopping()) return;
+    bool idle;
+    {
+      MutexLock lock(mu_);
+      idle = !scheduled_ && !park_ && fifo_.empty();
+      if (idle) scheduled_ = true;  // this thread runs the queue for the closure's time
+    }
+    if (!idle) return async(std::move(task));
+    core_->taskAdded();
+    runGuarded(task);
+    task = nullptr;
+    core_->taskFinished();
+    bool schedule;
+    {
+      MutexLock lock(mu_);
+      // What was submitted meanwhile is the pool's to run; a park the closure made
+      // schedules the queue when it ends.
+      schedule = !fifo_.empty() && !park_;
+      if (!schedule) scheduled_ = false;
+    }
+    if (schedule) core_->submitQueue(shared_from_this(), qos_);
+  }
+
   const std::string& label() const override { return label_; }
   QoS qos() const { return qos_; }
 

@@ -14,7 +14,7 @@ struct ServiceLimits {
   std::size_t maxSessionsPerClient = 64;          // MaxSessionsPerClient
   std::size_t maxClients = 512;                   // MaxClients: bus connections known at once
   std::size_t maxHeldStartsPerClient = 64;        // MaxHeldStartsPerClient: unanswered starts
-  std::size_t maxKeptBytesPerSession = 4u << 20;  // MaxKeptBytesPerSession: payloads kept for the summary
+  std::size_t maxKeptBytesPerSession = 1u << 20;  // MaxKeptBytesPerSession: payloads kept for the summary
   std::size_t maxQueuedRows = 100000;             // MaxQueuedRows: rows waiting for the store
 };
 

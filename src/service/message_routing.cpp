@@ -41,7 +41,9 @@ void VRReportingServerInstance::sendMessage(Dictionary payload, std::uint32_t ca
                                             std::optional<std::vector<std::int64_t>> reporterIDs, ErrorReply reply) {
   VR_DEBUG(env_->logger(), LogScope::Server, kSendLabel, "sending message for reporter %s",
            idsText(reporterIDs).c_str());
-  serverQueue_->async([self = shared_from_this(), payload = std::move(payload), category, type,
+  // A message is routed and answered quickly: on an idle server queue, where the call
+  // arrived, without waking another thread and back.
+  serverQueue_->asyncOrRun([self = shared_from_this(), payload = std::move(payload), category, type,
                        reporterIDs = std::move(reporterIDs), reply = std::move(reply)] {
     self->doSendMessage(payload, category, type, reporterIDs, reply);
   });

@@ -10,16 +10,12 @@
 
 namespace vireo {
 
-VRReportingServiceDelegate::VRReportingServiceDelegate(std::shared_ptr<ReportingEnvironment> env,
-                                                       std::shared_ptr<SerialQueue> serverQueue)
+VRReportingServiceDelegate::VRReportingServiceDelegate(std::shared_ptr<ReportingEnvironment> env)
     : env_(std::move(env)),
-      serverQueue_(serverQueue ? std::move(serverQueue)
-                               : env_->platform.dispatcher.makeSerialQueue(kServerQueueLabel, QoS::UserInteractive)) {}
+      serverQueue_(env_->platform.dispatcher.makeSerialQueue(kServerQueueLabel, QoS::UserInteractive)) {}
 
-std::shared_ptr<VRReportingServiceDelegate> VRReportingServiceDelegate::init(std::shared_ptr<ReportingEnvironment> env,
-                                                                             std::shared_ptr<SerialQueue> serverQueue) {
-  std::shared_ptr<VRReportingServiceDelegate> delegate(
-      new VRReportingServiceDelegate(std::move(env), std::move(serverQueue)));
+std::shared_ptr<VRReportingServiceDelegate> VRReportingServiceDelegate::init(std::shared_ptr<ReportingEnvironment> env) {
+  std::shared_ptr<VRReportingServiceDelegate> delegate(new VRReportingServiceDelegate(std::move(env)));
   // The registry starts empty and reporting on; the defaults are not read until the
   // first change notification.
   delegate->listenForDefaultsNotification();

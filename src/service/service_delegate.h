@@ -40,9 +40,7 @@ class VRReportingServiceDelegate final : public VRReportingServiceDelegateProtoc
  public:
   // init: the server queue, an empty registry, reporting on, the defaults
   // notification registered, the driver utility subscribed.
-  // serverQueue: where the server's closures run; by default a queue of the dispatcher.
-  static std::shared_ptr<VRReportingServiceDelegate> init(std::shared_ptr<ReportingEnvironment> env,
-                                                          std::shared_ptr<SerialQueue> serverQueue = nullptr);
+  static std::shared_ptr<VRReportingServiceDelegate> init(std::shared_ptr<ReportingEnvironment> env);
   VRReportingServiceDelegate(const VRReportingServiceDelegate&) = delete;
   VRReportingServiceDelegate& operator=(const VRReportingServiceDelegate&) = delete;
 
@@ -65,7 +63,7 @@ class VRReportingServiceDelegate final : public VRReportingServiceDelegateProtoc
   const VRReportingDriverUtility& driverUtility() const { return *driverUtility_; }
 
  private:
-  VRReportingServiceDelegate(std::shared_ptr<ReportingEnvironment> env, std::shared_ptr<SerialQueue> serverQueue);
+  explicit VRReportingServiceDelegate(std::shared_ptr<ReportingEnvironment> env);
 
   // Server queue only.
   void defaultsChanged(int token);

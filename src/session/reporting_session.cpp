@@ -18,8 +18,10 @@ constexpr std::uint16_t kTestServiceType = 11;
 constexpr const char* kClientName = "com.orvane.vireo";
 constexpr std::int64_t kClientType = 19;
 constexpr double kClientVersion = 2.0;
-// Kept payload bytes past which a stop hands freed memory back to the system.
-constexpr std::size_t kReleaseMemoryAfterBytes = 1 << 20;
+// Kept payload bytes past which a stop hands freed memory back to the system, once
+// the store has had a moment to write what the session sent last.
+constexpr std::size_t kReleaseMemoryAfterBytes = 256 << 10;
+constexpr std::chrono::milliseconds kReleaseMemoryDelay{250};
 
 }  // namespace
 
@@ -146,7 +148,7 @@ void VRReportingSession::stop() {
   started_ = false;
   // A large summary leaves free memory behind; once it is gone, give it back.
   if (released >= kReleaseMemoryAfterBytes)
-    env_->platform.dispatcher.asyncLowPriority(std::chrono::nanoseconds::zero(),
+    env_->platform.dispatcher.asyncLowPriority(kReleaseMemoryDelay,
                                                [env = env_] { env->platform.process.releaseFreeMemory(); });
 
   // Every started session was given a callback by its server instance; a missing one

@@ -24,7 +24,7 @@ class ReportingEnvironment {
   // logs and waits again; tests shorten it.
   std::atomic<double> backendWaitInterval{9.0};
   // Bytes of payloads one session keeps for its summary (limits.conf MaxKeptBytesPerSession).
-  std::atomic<std::size_t> maxKeptBytesPerSession{4u << 20};
+  std::atomic<std::size_t> maxKeptBytesPerSession{1u << 20};
   // Payloads let go for that budget, over the process's life.
   std::atomic<std::uint64_t> keptPayloadsDropped{0};
 
