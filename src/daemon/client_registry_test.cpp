@@ -8,8 +8,6 @@
 
 #include "daemon/bus_choice.h"
 #include "daemon/bus_mailbox.h"
-#include "daemon/notification_center.h"
-#include "fakes/fake_platform.h"
 
 namespace vireo::daemon {
 namespace {
@@ -89,15 +87,6 @@ TEST(BusChoiceTest, OverrideThenStarterThenUser) {
   EXPECT_EQ(chooseBus(nullptr, "starter", true), BusKind::System);
   EXPECT_EQ(chooseBus(nullptr, nullptr, true), BusKind::System);
   EXPECT_EQ(chooseBus(nullptr, nullptr, false), BusKind::Session);
-}
-
-// Delivery by name is checked through the bus (bus_service_test); here the refusals.
-TEST(NotificationCenterTest, RefusesEmptyNamesAndMissingQueues) {
-  NotificationCenter center;
-  int token = 0;
-  auto queue = std::make_shared<testing::ManualQueue>("q", QoS::Default);
-  EXPECT_NE(center.registerDispatch("", queue, [](int) {}, &token), 0);
-  EXPECT_NE(center.registerDispatch("a", nullptr, [](int) {}, &token), 0);
 }
 
 TEST(BusMailboxTest, RunsInOrderAndInlineOnceClosed) {

@@ -56,8 +56,9 @@ class RoutingTest : public ::testing::Test {
   std::unique_ptr<FakeConnection> a, b;
 };
 
-// Named sessions get the message whether started or not, after the sinks.
-TEST_F(RoutingTest, AddressedCallsTheSinksBeforeTheNamedSessions) {
+// Named sessions get the message whether started or not, after the sinks; empty, zero or
+// unknown lists reach nobody.
+TEST_F(RoutingTest, AddressedCallsTheSinksBeforeTheNamedSessionsOnly) {
   watched = session(3);
   EXPECT_FALSE(send(std::vector<std::int64_t>{3, 2}, Dictionary{{"EngineOnTime", 4.0}}));
   EXPECT_EQ(calls, (Calls{{"analytics", 0}, {"energy", 0}, {"analytics", 1}, {"energy", 1}}));
@@ -70,6 +71,19 @@ TEST_F(RoutingTest, AddressedCallsTheSinksBeforeTheNamedSessions) {
   h.fake.dispatcher.runLowPriority();
   ASSERT_EQ(h.fake.telemetry.oneShots().size(), 1u);
   EXPECT_EQ(h.fake.tracer.count(trace::kServerSend), 1u);
+
+  // Empty, zero or unknown lists reach nobody, and have no standalone fallback.
+  calls.clear();
+  for (const auto& ids : {std::vector<std::int64_t>{}, std::vector<std::int64_t>{0, 0}, std::vector<std::int64_t>{0, 99}})
+    EXPECT_FALSE(send(ids));
+  h.fake.dispatcher.runLowPriority();
+  EXPECT_EQ(h.fake.telemetry.oneShots().size(), 1u);
+  EXPECT_TRUE(calls.empty());
+  EXPECT_EQ(payloads(3), 1);
+  auto misses = h.fake.logger.matching("failed to find reporting session 99");
+  ASSERT_EQ(misses.size(), 1u);
+  EXPECT_EQ(misses[0].level, LogLevel::Error);
+  EXPECT_FALSE(h.fake.logger.contains("failed to find reporting session 0"));
 }
 
 TEST_F(RoutingTest, BroadcastReachesStartedSessionsOfEveryClientSessionFirst) {
@@ -87,23 +101,8 @@ TEST_F(RoutingTest, BroadcastReachesStartedSessionsOfEveryClientSessionFirst) {
   EXPECT_TRUE(h.fake.telemetry.oneShots().empty());
 }
 
-TEST_F(RoutingTest, EmptyZeroOrUnknownListsSendNothing) {
-  for (const auto& ids : {std::vector<std::int64_t>{}, std::vector<std::int64_t>{0, 0}, std::vector<std::int64_t>{0, 99}}) {
-    EXPECT_FALSE(send(ids));
-  }
-  h.fake.dispatcher.runLowPriority();
-  EXPECT_TRUE(h.fake.telemetry.oneShots().empty()) << "no standalone fallback for a list";
-  EXPECT_TRUE(h.fake.analytics.events().empty());
-  EXPECT_EQ(payloads(1), 0);
-  EXPECT_EQ(payloads(3), 0);
-  auto misses = h.fake.logger.matching("failed to find reporting session 99");
-  ASSERT_EQ(misses.size(), 1u);
-  EXPECT_EQ(misses[0].level, LogLevel::Error);
-  EXPECT_FALSE(h.fake.logger.contains("failed to find reporting session 0"));
-}
-
 TEST_F(RoutingTest, DisabledReportingRefusesBeforeAnySessionOrSinkSeesTheMessage) {
-  h.fake.defaults.set("com.orvane.vireo", "disable_reporting", "yes");
+  h.fake.defaults.set("disable_reporting", "yes");
   h.postDefaults();
   for (const auto& ids : {std::optional<std::vector<std::int64_t>>{}, std::optional{std::vector<std::int64_t>{1}}}) {
     auto error = send(ids, Dictionary{{"EngineOnTime", 1.0}});

@@ -41,7 +41,7 @@ TEST_F(SinksTest, AnalyticsEventNameAndPayload) {
   EXPECT_EQ(message.find("HostApplicationDisplayID")->text(), "spoofed");
 
   // An event nobody wants is not built.
-  p.analytics.addUnwanted("com.orvane.vireo.Playback.Start");
+  p.analytics.unwanted.set({"com.orvane.vireo.Playback.Start"});
   VRReportingTallyhubBridge::handleEvent(p.env, &message, 3, 1, *s);
   EXPECT_EQ(p.analytics.events().size(), 3u);
   EXPECT_EQ(p.analytics.skipped(), std::vector<std::string>{"com.orvane.vireo.Playback.Start"});

@@ -45,20 +45,10 @@ TEST(ThrottleKeyTest, BuildsKeys) {
       {"non-string key", {{Value(7), "x"}, {"6", "y"}}, "6|y|7|x|"},
   };
   for (const auto& c : cases) EXPECT_EQ(keyOf(c.message), c.expected + kTail) << c.name;
-}
-
-TEST(ThrottleKeyTest, SameAndDifferentMessages) {
-  Dictionary base{{"Route", "Speaker"}, {"vrreporting_timestamp", 1}, {"processuptime_ms", 2}};
-  Dictionary later{{"Route", "Speaker"}, {"vrreporting_timestamp", 99}, {"processuptime_ms", 98}};
-  EXPECT_EQ(keyOf(base), keyOf(later));
-  EXPECT_NE(keyOf(base), keyOf(base, 43));
-  EXPECT_NE(keyOf(base), keyOf(base, 42, 0x40000004));
-  EXPECT_NE(keyOf(base), keyOf(base, 42, kPlaybackStart[0], 2));
-
-  Dictionary ab{{"a", 1}, {"b", Dictionary{{"x", 1}, {"y", 2}}}};
-  Dictionary ba{{"b", Dictionary{{"y", 2}, {"x", 1}}}, {"a", 1}};
-  EXPECT_EQ(keyOf(ab), keyOf(ba));
-  EXPECT_NE(keyOf(ab), keyOf({{"a", 1}, {"b", Dictionary{{"x", 1}, {"y", 3}}}}));
+  const Dictionary m{{"Route", "Speaker"}};
+  EXPECT_NE(keyOf(m), keyOf(m, 43));
+  EXPECT_NE(keyOf(m), keyOf(m, 42, 0x40000004));
+  EXPECT_NE(keyOf(m), keyOf(m, 42, kPlaybackStart[0], 2));
 }
 
 TEST(ThrottleSleepTimeTest, ReadsAndBoundsTheHold) {
@@ -101,7 +91,7 @@ struct Rig {
     double at;
   };
 
-  Rig() { logger.setVerbose(LogScope::Session, true); }
+  Rig() { logger.setVerbose(LogScope::Session); }
   ~Rig() { throttle->stop(); }
 
   void sleepUntil(double seconds) {

@@ -34,8 +34,7 @@ class Locked {
     std::lock_guard guard(lock_);
     return f(value_);
   }
-  T get() const { return with([](T& v) { return v; }); }
-  T operator()() const { return get(); }
+  T operator()() const { return with([](T& v) { return v; }); }
   // The old value (closures that may own engine objects) dies after the lock is released.
   void set(T value) { with([&](T& old) { std::swap(old, value); }); }
 
@@ -50,22 +49,9 @@ struct Recorder : Locked<std::vector<T>> {
   void add(T item) { this->with([&](std::vector<T>& v) { v.push_back(std::move(item)); }); }
 };
 
-template <typename T>
-std::optional<T> popFront(Locked<std::deque<T>>& items) {
-  return items.with([](std::deque<T>& d) -> std::optional<T> {
-    if (d.empty()) return std::nullopt;
-    std::optional<T> item(std::move(d.front()));
-    d.pop_front();
-    return item;
-  });
-}
-
 template <typename M>
 std::optional<typename M::mapped_type> lookup(const Locked<M>& map, const typename M::key_type& key) {
-  return map.with([&](M& m) -> std::optional<typename M::mapped_type> {
-    auto it = m.find(key);
-    return it == m.end() ? std::nullopt : std::optional(it->second);
-  });
+  return map.with([&](M& m) { return m.count(key) ? std::optional(m.at(key)) : std::nullopt; });
 }
 
 struct LogEntry { LogScope scope; LogLevel level; std::string function, message; };
@@ -76,9 +62,7 @@ struct RecordingLogger : Logger {
              std::string_view message) override {
     entries.add({scope, level, function ? function : "", std::string(message)});
   }
-  void setVerbose(LogScope scope, bool on) {
-    verbose_.with([&](auto& s) { on ? (void)s.insert(scope) : (void)s.erase(scope); });
-  }
+  void setVerbose(LogScope scope) { verbose_.with([&](auto& s) { s.insert(scope); }); }
   std::vector<LogEntry> matching(std::string_view text) const {
     auto all = entries();
     std::erase_if(all, [&](auto& e) { return e.message.find(text) == std::string::npos; });
@@ -94,10 +78,7 @@ struct RecordingLogger : Logger {
 
 struct RecordingTracer : Tracer {
   void emit(std::uint32_t code) override { codes.add(code); }
-  std::size_t count(std::uint32_t code) const {
-    auto all = codes();
-    return static_cast<std::size_t>(std::count(all.begin(), all.end(), code));
-  }
+  std::size_t count(std::uint32_t code) const { return codes.with([&](auto& c) { return std::ranges::count(c, code); }); }
   Recorder<std::uint32_t> codes;
 };
 
@@ -109,37 +90,32 @@ struct FakeClock : Clock {
   Locked<WallTime::duration> moved;
 };
 
-// Returns the scripted values in order (each reduced below the bound), then 0.
+// Answers next once (reduced below the bound), then 0.
 struct FakeRandom : RandomSource {
   std::uint32_t uniformBelow(std::uint32_t bound) override {
     boundsAsked.add(bound);
-    std::uint32_t v = popFront(script_).value_or(0);
-    return bound == 0 ? 0 : v % bound;
-  }
-  void script(std::initializer_list<std::uint32_t> values) {
-    script_.with([&](auto& s) { s.insert(s.end(), values); });
+    return bound == 0 ? 0 : next.exchange(0) % bound;
   }
   Recorder<std::uint32_t> boundsAsked;
-  Locked<std::deque<std::uint32_t>> script_;
+  std::atomic<std::uint32_t> next{0};
 };
 
 class ManualQueue;
 
 // A park of a ManualQueue; it holds the queue and the timeout closure until it ends.
+// Made without a queue, it is spent from the start.
 class ManualParking : public Parking {
  public:
-  ManualParking() = default;  // spent from the start
-  ManualParking(std::shared_ptr<ManualQueue> queue, Task onTimeout) {
+  explicit ManualParking(std::shared_ptr<ManualQueue> queue = nullptr, Task onTimeout = nullptr) {
     held_.set(Held{std::move(queue), std::move(onTimeout)});
   }
-  inline bool resume(Task next) override;
-  inline bool expire();
+  bool resume(Task next) override { return end(std::move(next), false); }
+  inline bool end(Task next, bool timedOut);
   // Lets go of the queue and the timeout closure unrun.
   void spend() { held_.set({}); }
 
  private:
   struct Held { std::shared_ptr<ManualQueue> queue; Task onTimeout; };
-  inline bool end(Task next, bool timedOut);
   Locked<Held> held_;
 };
 
@@ -149,25 +125,17 @@ class ManualQueue : public SerialQueue, public std::enable_shared_from_this<Manu
  public:
   using Nanos = std::chrono::nanoseconds;
   // now: the manual time deadlines are measured on (the dispatcher's); a queue of its own otherwise.
-  ManualQueue(std::string label, QoS qos, std::shared_ptr<Locked<Nanos>> now = std::make_shared<Locked<Nanos>>())
-      : label_(std::move(label)), qos_(qos), now_(std::move(now)) {}
+  explicit ManualQueue(std::string label, std::shared_ptr<Locked<Nanos>> now = std::make_shared<Locked<Nanos>>())
+      : label_(std::move(label)), now_(std::move(now)) {}
   void async(Task task) override { state_.with([&](State& s) { s.tasks.push_back(std::move(task)); }); }
   const std::string& label() const override { return label_; }
   std::shared_ptr<Parking> park(Nanos timeout, Task onTimeout) override {
-    parkTimeouts.add(timeout);
     auto parking = std::make_shared<ManualParking>(shared_from_this(), std::move(onTimeout));
-    const Nanos due = now_->get() + timeout;
-    bool taken = state_.with([&](State& s) {
-      if (s.park) return false;
-      s.park = parking;
-      s.due = due;
-      return true;
-    });
-    if (taken) return parking;
+    const Nanos due = (*now_)() + timeout;
+    if (state_.with([&](State& s) { return !s.park && (s.park = parking, s.due = due, true); })) return parking;
     parking->spend();
     return std::make_shared<ManualParking>();
   }
-  QoS qos() const { return qos_; }
   // Runs the next closure unless the queue is parked.
   bool runOne() {
     auto task = state_.with([](State& s) -> std::optional<Task> {
@@ -179,15 +147,9 @@ class ManualQueue : public SerialQueue, public std::enable_shared_from_this<Manu
     if (task && *task) (*task)();
     return task.has_value();
   }
-  bool parked() const { return state_.with([](State& s) { return s.park != nullptr; }); }
-  // The deadline of the pending park, on the manual time.
-  std::optional<Nanos> deadline() const {
-    return state_.with([](State& s) { return s.park ? std::optional(s.due) : std::nullopt; });
-  }
-  // Times the pending park out when its deadline has come.
-  bool expireIfDue() {
-    auto park = state_.with([&](State& s) { return s.park && s.due <= now_->get() ? s.park : nullptr; });
-    return park && park->expire();
+  // The pending park, if any, and its deadline on the manual time.
+  std::pair<Nanos, std::shared_ptr<ManualParking>> pending() const {
+    return state_.with([](State& s) { return std::pair(s.due, s.park); });
   }
   // Drops the queued closures and a pending park, whose timeout closure never runs.
   void clear() {
@@ -202,7 +164,6 @@ class ManualQueue : public SerialQueue, public std::enable_shared_from_this<Manu
       if (first) s.tasks.push_front(std::move(first));
     });
   }
-  Recorder<Nanos> parkTimeouts;
 
  private:
   struct State {
@@ -211,13 +172,10 @@ class ManualQueue : public SerialQueue, public std::enable_shared_from_this<Manu
     Nanos due{};
   };
   const std::string label_;
-  const QoS qos_;
   const std::shared_ptr<Locked<Nanos>> now_;
   Locked<State> state_;
 };
 
-bool ManualParking::resume(Task next) { return end(std::move(next), false); }
-bool ManualParking::expire() { return end(nullptr, true); }
 bool ManualParking::end(Task next, bool timedOut) {
   Held held = held_.with([](Held& h) { return std::exchange(h, Held{}); });
   if (!held.queue) return false;
@@ -231,8 +189,8 @@ bool ManualParking::end(Task next, bool timedOut) {
 class ManualDispatcher : public Dispatcher {
  public:
   ~ManualDispatcher() override { clear(); }
-  std::shared_ptr<SerialQueue> makeSerialQueue(std::string label, QoS qos) override {
-    auto q = std::make_shared<ManualQueue>(std::move(label), qos, now_);
+  std::shared_ptr<SerialQueue> makeSerialQueue(std::string label, QoS) override {
+    auto q = std::make_shared<ManualQueue>(std::move(label), now_);
     queues_.add(q);
     return q;
   }
@@ -241,11 +199,6 @@ class ManualDispatcher : public Dispatcher {
     lowPriority_.with([&](auto& l) { l.push_back(std::move(task)); });
   }
 
-  std::shared_ptr<ManualQueue> queue(std::string_view label) const {
-    for (auto& q : queues())
-      if (q->label() == label) return q;
-    return nullptr;
-  }
   // Runs serial-queue closures, including ones submitted meanwhile, until none is
   // left that may run; low-priority closures stay held, parked queues stay parked.
   void runAll() {
@@ -254,35 +207,35 @@ class ManualDispatcher : public Dispatcher {
       for (auto& q : queues()) ran = q->runOne() || ran;
     }
   }
+  // Runs low-priority closures, including ones submitted meanwhile, in order.
   std::size_t runLowPriority() {
     std::size_t n = 0;
-    for (std::optional<Task> t; (t = popFront(lowPriority_)); ++n)
-      if (*t) (*t)();
+    for (std::deque<Task> batch; !(batch = lowPriority_.with([](auto& l) { return std::exchange(l, {}); })).empty();)
+      for (Task& t : batch) {
+        if (t) t();
+        ++n;
+      }
     return n;
   }
   void runUntilIdle() { do runAll(); while (runLowPriority() != 0); }
   std::size_t pendingLowPriority() const { return lowPriority_.with([](auto& l) { return l.size(); }); }
   Recorder<std::chrono::nanoseconds> lowPriorityDelays;
 
-  // Moves the manual time on; parks whose deadline passes time out, earliest first
-  // (their timeout closures then wait for runAll).
+  // Moves the manual time on; parks whose deadline has passed time out (their timeout
+  // closures then wait for runAll). Returns how many timed out.
   std::size_t advance(std::chrono::nanoseconds d) {
-    now_->with([&](auto& now) { now += d; });
-    std::vector<std::pair<std::chrono::nanoseconds, std::shared_ptr<ManualQueue>>> due;
-    for (auto& q : queues())
-      if (auto at = q->deadline(); at && *at <= now_->get()) due.emplace_back(*at, q);
-    std::stable_sort(due.begin(), due.end(), [](auto& a, auto& b) { return a.first < b.first; });
+    const auto now = now_->with([&](auto& t) { return t += d; });
     std::size_t n = 0;
-    for (auto& [at, q] : due) n += q->expireIfDue() ? 1 : 0;
+    for (auto& q : queues())
+      if (auto [due, park] = q->pending(); park && due <= now) n += park->end(nullptr, true) ? 1 : 0;
     return n;
   }
   std::size_t parkedCount() const {
-    auto all = queues();
-    return static_cast<std::size_t>(std::count_if(all.begin(), all.end(), [](auto& q) { return q->parked(); }));
+    return std::ranges::count_if(queues(), [](auto& q) { return q->pending().second != nullptr; });
   }
   // Waits (on the real clock) until another thread has resumed every parked queue.
-  bool awaitUnparked(std::chrono::milliseconds budget = std::chrono::seconds(10)) const {
-    for (auto until = std::chrono::steady_clock::now() + budget; parkedCount() != 0;) {
+  bool awaitUnparked() const {
+    for (auto until = std::chrono::steady_clock::now() + std::chrono::seconds(10); parkedCount() != 0;) {
       if (std::chrono::steady_clock::now() > until) return false;
       std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
@@ -296,7 +249,7 @@ class ManualDispatcher : public Dispatcher {
  private:
   std::vector<std::shared_ptr<ManualQueue>> queues() const {
     std::vector<std::shared_ptr<ManualQueue>> out;
-    for (const auto& w : queues_.get())
+    for (const auto& w : queues_())
       if (auto q = w.lock()) out.push_back(q);
     return out;
   }
@@ -348,19 +301,18 @@ class FakeTelemetrySession : public TelemetrySession {
     return true;
   }
   void flushMessages(std::function<void(std::optional<Error>)> completion) override {
-    ++flushes_;
+    ++flushes;
     if (completion) completion(std::nullopt);
   }
   std::string description() const override { return "<FakeTelemetrySession>"; }
 
-  int flushes() const { return flushes_; }
   // Drops a completion held by BackendAnswer::Never (it may hold engine objects).
   void dropHeld() { held_.set(nullptr); }
   Recorder<SentMessage> sent;
+  std::atomic<int> flushes{0};
 
  private:
   const TelemetryBehaviour behaviour_;
-  std::atomic<int> flushes_{0};
   Locked<Completion> held_;
   std::thread answerThread_;  // set by the one startConfiguration call, joined on destruction
 };
@@ -377,14 +329,14 @@ class FakeTelemetryService : public TelemetryService {
   }
   std::shared_ptr<TelemetrySession> createSession(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                                   const std::vector<std::string>&) override {
-    auto s = std::make_shared<FakeTelemetrySession>(behaviour_.get());
+    auto s = std::make_shared<FakeTelemetrySession>(behaviour_());
     created.add({sessionInfo, userInfo, s});
     return s;
   }
   bool sendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo, std::uint16_t category,
                       std::uint16_t type, const Dictionary& payload, std::optional<Error>* error) override {
     oneShots.add({{category, type, payload}, sessionInfo, userInfo});
-    if (!behaviour_.get().refuseSends) return true;
+    if (!behaviour_().refuseSends) return true;
     if (error) *error = Error{kGeneralErrorDomain, 7, "refused by fake"};
     return false;
   }
@@ -407,15 +359,13 @@ struct AnalyticsEvent { std::string name; Dictionary payload; };
 struct FakeAnalyticsService : AnalyticsService {
   void sendEventLazy(std::string_view name, const std::function<Dictionary()>& payload) override {
     if (onCall) onCall();
-    if (unwanted_.with([&](auto& u) { return u.count(std::string(name)) != 0; })) return skipped.add(std::string(name));
+    if (unwanted.with([&](auto& u) { return u.count(std::string(name)) != 0; })) return skipped.add(std::string(name));
     events.add({std::string(name), payload ? payload() : Dictionary{}});  // built outside the lock
   }
-  // Events of this name are not wanted: their payload is never built.
-  void addUnwanted(std::string name) { unwanted_.with([&](auto& u) { u.insert(std::move(name)); }); }
   std::function<void()> onCall;  // runs first in every call; set before any thread runs
   Recorder<AnalyticsEvent> events;
   Recorder<std::string> skipped;
-  Locked<std::set<std::string>> unwanted_;
+  Locked<std::set<std::string>> unwanted;  // events of these names are not wanted: no payload is built
 };
 
 struct EnergyEvent { int client = 0; std::string name; Dictionary event; };
@@ -429,28 +379,29 @@ struct FakeEnergyLogService : EnergyLogService {
   Recorder<EnergyEvent> events;
 };
 
+// Suite and key to value; the tests only set lower-case booleans.
 struct FakeDefaultsStore : DefaultsStore {
   std::optional<std::string> stringForKey(std::string_view suite, std::string_view key) override {
-    return lookup(values_, {std::string(suite), std::string(key)});
+    return lookup(values, {std::string(suite), std::string(key)});
   }
-  // The tests only set lower-case booleans.
   bool boolForKey(std::string_view suite, std::string_view key) override {
     auto v = stringForKey(suite, key);
     return v == "1" || v == "yes" || v == "true" || v == "on";
   }
-  void set(std::string suite, std::string key, std::string value) {
-    values_.with([&](auto& v) { v[{std::move(suite), std::move(key)}] = std::move(value); });
+  // A key of the service's own suite; nullopt removes it.
+  void set(const std::string& key, std::optional<std::string> value) {
+    values.with([&](auto& v) {
+      if (value) v[{"com.orvane.vireo", key}] = *value;
+      else v.erase({"com.orvane.vireo", key});
+    });
   }
-  void remove(const std::string& suite, const std::string& key) {
-    values_.with([&](auto& v) { v.erase({suite, key}); });
-  }
-  Locked<std::map<std::pair<std::string, std::string>, std::string>> values_;
+  Locked<std::map<std::pair<std::string, std::string>, std::string>> values;
 };
 
 struct FakeNotificationService : NotificationService {
   int registerDispatch(std::string name, std::shared_ptr<SerialQueue> queue, std::function<void(int)> handler,
                        int* token) override {
-    int t = registrations_.with([&](auto& r) {
+    int t = registrations.with([&](auto& r) {
       r.push_back({std::move(name), std::move(queue), std::move(handler), static_cast<int>(r.size()) + 1});
       return r.back().token;
     });
@@ -458,14 +409,13 @@ struct FakeNotificationService : NotificationService {
     return 0;
   }
   void post(const std::string& name) {
-    for (auto& r : registrations_.get())
+    for (auto& r : registrations())
       if (r.name == name) r.queue->async([handler = r.handler, t = r.token] { handler(t); });
   }
-  void clear() { registrations_.set({}); }
   struct Registration {
     std::string name; std::shared_ptr<SerialQueue> queue; std::function<void(int)> handler; int token;
   };
-  Recorder<Registration> registrations_;
+  Recorder<Registration> registrations;
 };
 
 // Answers "InternalBuild" and "DeviceClassNumber", when set.
@@ -484,19 +434,16 @@ struct FakeDeviceProperties : DeviceProperties {
 struct FakeProcessTable : ProcessTable {
   std::int32_t selfPid() const override { return 4242; }
   std::optional<std::string> selfName() const override { return "vireod"; }
-  std::optional<std::string> shortName(std::int32_t pid) const override { return lookup(names_, pid); }
-  void setName(std::int32_t pid, std::string name) { names_.with([&](auto& n) { n[pid] = std::move(name); }); }
-  Locked<std::map<std::int32_t, std::string>> names_;
+  std::optional<std::string> shortName(std::int32_t pid) const override { return lookup(names, pid); }
+  void setName(std::int32_t pid, std::string name) { names.with([&](auto& n) { n[pid] = std::move(name); }); }
+  Locked<std::map<std::int32_t, std::string>> names;
 };
 
 // In-memory files under a fixed log directory.
 struct FakeDiagnosticFiles : DiagnosticFiles {
   std::string logDirectory() const override { return "/fake/logs"; }
   bool createDirectory(const std::string& path, unsigned, Error* error) override {
-    if (auto failure = createDirectoryError()) {
-      if (error) *error = *failure;
-      return false;
-    }
+    if (auto failure = createDirectoryError()) return *error = *failure, false;
     directories.with([&](auto& d) { d.insert(path); });
     return true;
   }
@@ -509,54 +456,29 @@ struct FakeDiagnosticFiles : DiagnosticFiles {
   Locked<std::optional<Error>> createDirectoryError;
 };
 
-// One driver ("Speaker", no subgroup) with one channel "X" whose value the test sets;
-// deltas are later minus earlier. Every other driver has no channels.
+// No driver has statistics (the driver utility has its own tests over a scripted library).
 struct FakeDriverStats : DriverStatsLibrary {
-  struct Channels : DriverChannelSet {
-    explicit Channels(bool s) : speaker(s) {}
-    bool speaker;
-  };
-  struct Subscribed : DriverSubscribedChannels {
-    std::unique_ptr<DriverSubscribedChannels> copy() const override { return std::make_unique<Subscribed>(); }
-  };
-  struct Samples : DriverSampleSet, DriverChannel {
-    explicit Samples(std::int64_t v) : value(v) {}
-    std::unique_ptr<DriverSampleSet> copy() const override { return std::make_unique<Samples>(value); }
-    std::int64_t value;
-  };
-
-  void setValue(std::int64_t v) { value_ = v; }
-  std::unique_ptr<DriverChannelSet> copyChannelsInGroup(const std::optional<std::string>& group,
+  std::unique_ptr<DriverChannelSet> copyChannelsInGroup(const std::optional<std::string>&,
                                                         const std::optional<std::string>&, std::uint64_t,
                                                         std::optional<DriverStatsError>*) override {
-    return std::make_unique<Channels>(group == "Speaker");
+    return nullptr;
   }
-  std::int32_t channelCount(const DriverChannelSet& set) override {
-    return static_cast<const Channels&>(set).speaker ? 1 : 0;
-  }
+  std::int32_t channelCount(const DriverChannelSet&) override { return 0; }
   DriverSubscriptionHandle createSubscription(const DriverChannelSet&,
-                                              std::unique_ptr<DriverSubscribedChannels>* subscribed) override {
-    *subscribed = std::make_unique<Subscribed>();
-    return this;
+                                              std::unique_ptr<DriverSubscribedChannels>*) override {
+    return nullptr;
   }
   std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle, const DriverSubscribedChannels&,
                                                  std::optional<DriverStatsError>*) override {
-    return std::make_unique<Samples>(value_);
+    return nullptr;
   }
-  std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet* earlier, const DriverSampleSet& later,
+  std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet*, const DriverSampleSet&,
                                                       std::optional<DriverStatsError>*) override {
-    std::int64_t before = earlier ? static_cast<const Samples*>(earlier)->value : 0;
-    return std::make_unique<Samples>(static_cast<const Samples&>(later).value - before);
+    return nullptr;
   }
-  void iterate(const DriverSampleSet& samples,
-               const std::function<DriverIterate(const DriverChannel&)>& visitor) override {
-    visitor(static_cast<const Samples&>(samples));
-  }
-  std::optional<std::string> channelName(const DriverChannel&) override { return "X"; }
-  std::int64_t simpleIntegerValue(const DriverChannel& channel) override {
-    return static_cast<const Samples&>(channel).value;
-  }
-  std::atomic<std::int64_t> value_{0};
+  void iterate(const DriverSampleSet&, const std::function<DriverIterate(const DriverChannel&)>&) override {}
+  std::optional<std::string> channelName(const DriverChannel&) override { return std::nullopt; }
+  std::int64_t simpleIntegerValue(const DriverChannel&) override { return 0; }
 };
 
 struct FakeProcessControl : ProcessControl {
@@ -568,30 +490,23 @@ struct FakeProcessControl : ProcessControl {
 struct FakeOrientationService : OrientationService {
   using Handlers = std::map<std::string, OrientationHandler>;
   void registerDeviceOrientationHandler(const std::string& id, OrientationHandler h) override {
-    calls.add("register device " + id);
-    device.with([&](Handlers& m) { m[id] = std::move(h); });
+    change("register device ", device, id, std::move(h));
   }
   void registerInterfaceOrientationHandler(const std::string& id, OrientationHandler h) override {
-    calls.add("register ui " + id);
-    ui.with([&](Handlers& m) { m[id] = std::move(h); });
+    change("register ui ", ui, id, std::move(h));
   }
-  void unregisterDeviceOrientationHandler(const std::string& id) override {
-    calls.add("unregister device " + id);
-    drop(device, id);
-  }
-  void unregisterInterfaceOrientationHandler(const std::string& id) override {
-    calls.add("unregister ui " + id);
-    drop(ui, id);
-  }
+  void unregisterDeviceOrientationHandler(const std::string& id) override { change("unregister device ", device, id, {}); }
+  void unregisterInterfaceOrientationHandler(const std::string& id) override { change("unregister ui ", ui, id, {}); }
   // Calls every handler of the kind with the orientation.
   static void fire(const Locked<Handlers>& handlers, Orientation o) {
     for (auto& [id, h] : handlers()) h(o);
   }
-  static void drop(Locked<Handlers>& handlers, const std::string& id) {
-    OrientationHandler old;  // may own a session: let it go outside the lock
+  void change(const std::string& what, Locked<Handlers>& handlers, const std::string& id, OrientationHandler h) {
+    calls.add(what + id);
     handlers.with([&](Handlers& m) {
-      if (auto it = m.find(id); it != m.end()) old = std::move(it->second), m.erase(it);
-    });
+      std::swap(m[id], h);
+      if (!m[id]) m.erase(id);
+    });  // h, now the old handler, may own a session: it goes after the lock is released
   }
   Recorder<std::string> calls;
   Locked<Handlers> device, ui;
@@ -623,13 +538,12 @@ struct FakePlatform {
   ~FakePlatform() {
     analytics.onCall = energyLog.onCall = nullptr;
     telemetry.dropHeld();
-    notifications.clear();
+    notifications.registrations.set({});
     dispatcher.clear();
     orientation.device.set({});
     orientation.ui.set({});
   }
 
-  void setInternalBuild(bool internal) { device.internalBuild.set(internal); }
   // These fakes over another dispatcher (the thread tests use the real pool).
   Platform over(Dispatcher& d) {
     return {logger,        tracer, clock,     random, d,           telemetry, analytics, energyLog, defaults,

@@ -1,11 +1,9 @@
-// The driver-statistics tree: the input lays out a small tree (groups, subgroups,
-// counter files, symlinks live and dangling, dot files, entries too deep or too
-// shallow) and fills the counters with arbitrary text, then the library scans it,
-// samples it twice (counters rewritten in between) and takes deltas.
-//
-// Checked beyond not crashing: the scan finds channels only where the layout puts
-// them, each sample holds what parseStatsCounter makes of the file, and deltas are
-// the saturated differences.
+// The driver-statistics tree: the input lays out a small tree (groups, subgroups, counter
+// files, symlinks live and dangling, dot files, entries too deep or too shallow) with
+// arbitrary counter text; the library scans it, samples it twice (counters rewritten in
+// between) and takes deltas. The scan must find channels only where the layout puts them,
+// each sample must hold what parseStatsCounter makes of the file, and deltas must be the
+// saturated differences.
 #include <fuzzer/FuzzedDataProvider.h>
 #include <unistd.h>
 

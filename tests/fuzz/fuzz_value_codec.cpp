@@ -1,20 +1,16 @@
-// Reads D-Bus messages of arbitrary type and content the way the daemon reads a
-// client's call: any value, a configuration dictionary, or SendMessage's arguments.
-//
-// sd-bus only hands the daemon messages that passed its own validation, so the input
-// drives a generator instead of being taken as wire bytes: it picks the signature
-// (nesting past the refusal limits, variants in variants, every basic type, file
-// descriptors) and the values, builds the message with sd-bus and seals it.
-//
-// Beyond not crashing, whatever is read must write back (appendVariant, the daemon's
-// way of answering) and read again to the same value, and must convert to JSON as the
-// store does.
+// Reads D-Bus messages the way the daemon reads a client's call: any value, a
+// configuration dictionary, or SendMessage's arguments. sd-bus only hands over messages
+// that passed its own validation, so the input drives a generator (signatures nested past
+// the limits, variants in variants, every basic type, file descriptors) instead of being
+// taken as wire bytes. Whatever is read must write back (appendVariant, the daemon's way
+// of answering) and read again to the same value, and convert to JSON as the store does;
+// a refusal must name an error.
 #include <fcntl.h>
 #include <fuzzer/FuzzedDataProvider.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
-#include <cmath>
+#include <bit>
 #include <cstdint>
 #include <string>
 #include <string_view>
@@ -55,7 +51,7 @@ int devNull() {
   return fd;
 }
 
-bool isBasic(char c) { return std::string_view("ybnqiuxtdsogh").find(c) != std::string_view::npos; }
+constexpr std::string_view kBasic = "ybnqiuxtdsogh";
 
 // Length of the single complete type at the start of s.
 std::size_t completeTypeLength(std::string_view s) {
@@ -74,22 +70,15 @@ class Generator {
  public:
   Generator(FuzzedDataProvider& in) : in_(in) {}
 
-  char basicType() {
-    static constexpr char kBasic[] = "ybnqiuxtdsogh";
-    return kBasic[in_.ConsumeIntegralInRange<std::size_t>(0, sizeof kBasic - 2)];
-  }
+  char basicType() { return kBasic[in_.ConsumeIntegralInRange<std::size_t>(0, kBasic.size() - 1)]; }
 
   // A random complete type, kept short enough for a D-Bus signature.
   std::string type(int depth, std::size_t budget) {
-    const int choice = in_.ConsumeIntegralInRange<int>(0, depth >= kMaxTypeDepth || budget < 8 ? 0 : 5);
-    switch (choice) {
+    switch (in_.ConsumeIntegralInRange<int>(0, depth >= kMaxTypeDepth || budget < 8 ? 0 : 5)) {
       case 0:
-      case 1:
-        return std::string(1, basicType());
-      case 2:
-        return "v";
-      case 3:
-        return "a" + type(depth + 1, budget - 1);
+      case 1: return std::string(1, basicType());
+      case 2: return "v";
+      case 3: return "a" + type(depth + 1, budget - 1);
       case 4: {
         std::string key(1, basicType());
         return "a{" + key + type(depth + 1, budget - 4) + "}";
@@ -108,7 +97,7 @@ class Generator {
   // generator cannot repair; the input is then skipped.
   bool value(sd_bus_message* m, std::string_view t) {
     const char c = t[0];
-    if (isBasic(c)) return basic(m, c);
+    if (kBasic.find(c) != std::string_view::npos) return basic(m, c);
     if (c == 'v') {
       ++variants_;
       std::string inner = variants_ >= kMaxVariantChain ? std::string(1, basicType())
@@ -121,13 +110,8 @@ class Generator {
     }
     if (c == '(') {
       std::string contents(t.substr(1, t.size() - 2));
-      if (sd_bus_message_open_container(m, 'r', contents.c_str()) < 0) return false;
-      for (std::string_view rest = contents; !rest.empty();) {
-        std::size_t n = completeTypeLength(rest);
-        if (!value(m, rest.substr(0, n))) return false;
-        rest.remove_prefix(n);
-      }
-      return sd_bus_message_close_container(m) >= 0;
+      return sd_bus_message_open_container(m, 'r', contents.c_str()) >= 0 && values(m, contents) &&
+             sd_bus_message_close_container(m) >= 0;
     }
     // Arrays and dictionaries.
     std::string element(t.substr(1));
@@ -161,59 +145,28 @@ class Generator {
   }
 
  private:
+  template <typename T>
+  static bool append(sd_bus_message* m, char c, T v) { return sd_bus_message_append_basic(m, c, &v) >= 0; }
+
   bool basic(sd_bus_message* m, char c) {
     switch (c) {
-      case 'y': {
-        auto v = in_.ConsumeIntegral<std::uint8_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'b': {
-        int v = in_.ConsumeBool() ? 1 : 0;
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'n': {
-        auto v = in_.ConsumeIntegral<std::int16_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'q': {
-        auto v = in_.ConsumeIntegral<std::uint16_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'i': {
-        auto v = in_.ConsumeIntegral<std::int32_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'u': {
-        auto v = in_.ConsumeIntegral<std::uint32_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'x': {
-        auto v = in_.ConsumeIntegral<std::int64_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 't': {
-        auto v = in_.ConsumeIntegral<std::uint64_t>();
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'd': {
-        // Raw bits, so NaNs, infinities and subnormals all occur.
-        auto bits = in_.ConsumeIntegral<std::uint64_t>();
-        double v = 0;
-        static_assert(sizeof v == sizeof bits);
-        __builtin_memcpy(&v, &bits, sizeof v);
-        return sd_bus_message_append_basic(m, c, &v) >= 0;
-      }
-      case 'h': {
-        int fd = devNull();
-        return sd_bus_message_append_basic(m, c, &fd) >= 0;
-      }
+      case 'y': return append(m, c, in_.ConsumeIntegral<std::uint8_t>());
+      case 'b': return append(m, c, int{in_.ConsumeBool()});
+      case 'n': return append(m, c, in_.ConsumeIntegral<std::int16_t>());
+      case 'q': return append(m, c, in_.ConsumeIntegral<std::uint16_t>());
+      case 'i': return append(m, c, in_.ConsumeIntegral<std::int32_t>());
+      case 'u': return append(m, c, in_.ConsumeIntegral<std::uint32_t>());
+      case 'x': return append(m, c, in_.ConsumeIntegral<std::int64_t>());
+      case 't': return append(m, c, in_.ConsumeIntegral<std::uint64_t>());
+      // Raw bits, so NaNs, infinities and subnormals all occur.
+      case 'd': return append(m, c, std::bit_cast<double>(in_.ConsumeIntegral<std::uint64_t>()));
+      case 'h': return append(m, c, devNull());
       default: {
         // s o g: sd-bus refuses bad UTF-8, object paths and signatures without
         // touching the message, so a refused text is replaced by a valid one.
         std::string text = in_.ConsumeRandomLengthString(24);
         if (sd_bus_message_append_basic(m, c, text.c_str()) >= 0) return true;
-        const char* fallback = c == 'o' ? "/a/b" : c == 'g' ? "a{sv}" : "text";
-        return sd_bus_message_append_basic(m, c, fallback) >= 0;
+        return sd_bus_message_append_basic(m, c, c == 'o' ? "/a/b" : c == 'g' ? "a{sv}" : "text") >= 0;
       }
     }
   }
@@ -222,31 +175,12 @@ class Generator {
   int variants_ = 0;
 };
 
-// Equality that takes a NaN as equal to itself, so round trips of NaNs compare.
+// Equality that takes every NaN as equal to itself: a dictionary's key identity.
 bool same(const Value& a, const Value& b) {
-  if (a.kind() != b.kind()) return false;
-  switch (a.kind()) {
-    case Value::Kind::Double:
-      return *a.asDouble() == *b.asDouble() || (std::isnan(*a.asDouble()) && std::isnan(*b.asDouble()));
-    case Value::Kind::Array: {
-      const Array& x = *a.asArray();
-      const Array& y = *b.asArray();
-      if (x.size() != y.size()) return false;
-      for (std::size_t i = 0; i < x.size(); ++i)
-        if (!same(x[i], y[i])) return false;
-      return true;
-    }
-    case Value::Kind::Dictionary: {
-      const Dictionary& x = *a.asDictionary();
-      const Dictionary& y = *b.asDictionary();
-      if (x.size() != y.size()) return false;
-      for (std::size_t i = 0; i < x.size(); ++i)
-        if (!same(x[i].first, y[i].first) || !same(x[i].second, y[i].second)) return false;
-      return true;
-    }
-    default:
-      return a == b;
-  }
+  Dictionary d;
+  d.set(a, 0);
+  d.set(b, 1);
+  return d.size() == 1;
 }
 
 MessageRef newMessage() {
@@ -318,23 +252,14 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   switch (mode) {
     case 0: {
       int r = 0;
-      for (;;) {
-        Value v;
-        r = dbus::readValue(m.get(), &v, error.get());
-        if (r <= 0) break;
-        checkReadValue(v);
-      }
+      for (Value v; (r = dbus::readValue(m.get(), &v, error.get())) > 0; v = Value()) checkReadValue(v);
       if (r < 0) checkRefusal(r, error);
       break;
     }
     case 1: {
       Dictionary configuration;
-      int r = dbus::readDictionary(m.get(), &configuration, error.get());
-      if (r < 0) {
-        checkRefusal(r, error);
-        break;
-      }
-      checkReadValue(Value(configuration));
+      if (int r = dbus::readDictionary(m.get(), &configuration, error.get()); r < 0) checkRefusal(r, error);
+      else checkReadValue(Value(configuration));
       break;
     }
     default: {

@@ -106,6 +106,9 @@ TEST_F(CtlTest, SequencesScriptsStoreQueriesAndTheReportingSwitch) {
   EXPECT_TRUE(eventually([&] { return (r = ctl({"send", "3", "1", "k=1"})).status == 1; }));
   EXPECT_NE(r.text.find("com.orvane.audio.reporting.ReportingDisabled"), std::string::npos) << r.text;
   ASSERT_EQ(ctl({"defaults", "delete", "disable_reporting"}).status, 0);
+  EXPECT_EQ(ctl({"defaults", "read", "disable_reporting"}).status, 1);  // a missing key
+  ASSERT_EQ(ctl({"defaults", "write", "device_name", "living", "room"}).status, 0);
+  EXPECT_EQ(ctl({"defaults", "read", "device_name"}).out, "living room\n");
   ASSERT_EQ(ctl({"notify"}).status, 0);
   EXPECT_TRUE(eventually([&] { return ctl({"send", "3", "1", "k=1"}).status == 0; }));
 

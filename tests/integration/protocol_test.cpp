@@ -114,9 +114,10 @@ TEST_F(ProtocolTest, ClientsShareLookupsAndAKilledClientIsRemoved) {
   EXPECT_TRUE(contains(all, 10) && contains(all, 20));
   EXPECT_EQ(*b->getAllReporters(), all);
 
-  // B starts A's session; B's stop does not reach it (own map only), A's does.
+  // B starts A's session; B's stop and destroy do not reach it (own map only), A's stop does.
   auto start = b->startReportingSessionForID(10);
   EXPECT_EQ(*b->stopReportingSessionForID(10), true);
+  EXPECT_EQ(*b->destroyReportingSession(10), true);
   EXPECT_FALSE(start.waitFor(300ms));
   // Setting the type from B changes nothing either.
   EXPECT_EQ(*b->setServiceType(9, 10), true);

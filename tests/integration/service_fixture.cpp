@@ -22,24 +22,20 @@ ChildProcess::~ChildProcess() { stop(); }
 
 bool ChildProcess::start(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
                          const std::string& outputFile, int* stdoutPipe) {
+  // Built before the fork: the child only calls what is safe after forking a threaded process.
   std::map<std::string, std::string> merged;
-  for (char** e = environ; *e; ++e) {
-    std::string kv = *e;
-    auto eq = kv.find('=');
-    if (eq != std::string::npos) merged[kv.substr(0, eq)] = kv.substr(eq + 1);
-  }
-  for (const auto& [k, v] : env) {
+  for (char** e = environ; *e; ++e)
+    if (const char* eq = std::strchr(*e, '=')) merged.emplace(std::string(*e, eq - *e), eq + 1);
+  for (const auto& [k, v] : env)
     if (v.empty()) merged.erase(k);
     else merged[k] = v;
-  }
-  std::vector<std::string> envStrings;
+  std::vector<std::string> argvCopy = argv, envStrings;
   for (const auto& [k, v] : merged) envStrings.push_back(k + "=" + v);
-  std::vector<char*> envp, args;
-  for (auto& s : envStrings) envp.push_back(s.data());
-  envp.push_back(nullptr);
-  std::vector<std::string> argvCopy = argv;
+  std::vector<char*> args, envp;
   for (auto& s : argvCopy) args.push_back(s.data());
+  for (auto& s : envStrings) envp.push_back(s.data());
   args.push_back(nullptr);
+  envp.push_back(nullptr);
 
   int pipeFds[2] = {-1, -1};
   if (stdoutPipe && pipe2(pipeFds, O_CLOEXEC) != 0) return false;
@@ -97,8 +93,7 @@ void ChildProcess::stop() {
 
 std::string ServiceTest::startPrivateBus(ChildProcess& bus, const std::string& dir) {
   int fd = -1;
-  if (!bus.start({"/usr/bin/dbus-daemon", "--session", "--nofork", "--print-address",
-                  "--address=unix:dir=" + dir},
+  if (!bus.start({"/usr/bin/dbus-daemon", "--session", "--nofork", "--print-address", "--address=unix:dir=" + dir},
                  {}, dir + "/dbus-daemon.log", &fd))
     return {};
   std::string address;
@@ -112,10 +107,7 @@ void ServiceTest::SetUp() {
   char tmpl[] = "/tmp/vireo-itest-XXXXXX";
   ASSERT_TRUE(mkdtemp(tmpl));
   dir_ = tmpl;
-  configDir_ = dir_ + "/conf";
-  stateDir_ = dir_ + "/state";
-  logsDir_ = dir_ + "/logs";
-  runtimeDir_ = dir_ + "/run";
+  configDir_ = dir_ + "/conf", stateDir_ = dir_ + "/state", logsDir_ = dir_ + "/logs", runtimeDir_ = dir_ + "/run";
   for (const auto& d : {configDir_, stateDir_, logsDir_, runtimeDir_}) fs::create_directories(d);
   daemonLog_ = dir_ + "/vireo-reportingd.log";
   busAddress_ = startPrivateBus(bus_, dir_);
@@ -125,15 +117,10 @@ void ServiceTest::SetUp() {
   prepareRuntimeDirectory(runtimeDir_);
   beforeDaemonStarts();
   if (HasFatalFailure()) return;
-  std::map<std::string, std::string> env{{"CONFIGURATION_DIRECTORY", configDir_},
-                                         {"STATE_DIRECTORY", stateDir_},
-                                         {"LOGS_DIRECTORY", logsDir_},
-                                         {"RUNTIME_DIRECTORY", runtimeDir_},
-                                         {"VIREO_BUS", "session"},
-                                         {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
-                                         {"DBUS_SYSTEM_BUS_ADDRESS", systemBusAddress_},
-                                         {"DBUS_STARTER_BUS_TYPE", ""},
-                                         {"JOURNAL_STREAM", ""}};
+  std::map<std::string, std::string> env{
+      {"CONFIGURATION_DIRECTORY", configDir_}, {"STATE_DIRECTORY", stateDir_}, {"LOGS_DIRECTORY", logsDir_},
+      {"RUNTIME_DIRECTORY", runtimeDir_}, {"VIREO_BUS", "session"}, {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
+      {"DBUS_SYSTEM_BUS_ADDRESS", systemBusAddress_}, {"DBUS_STARTER_BUS_TYPE", ""}, {"JOURNAL_STREAM", ""}};
   for (const auto& [k, v] : daemonEnvironment()) env[k] = v;
   ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH}, env, daemonLog_));
   auto probe = client::Client::connectAddress(busAddress_);
@@ -167,9 +154,8 @@ void ServiceTest::writeFile(const std::string& path, const std::string& text) {
 }
 
 std::string ServiceTest::readFile(const std::string& path) {
-  std::ifstream in(path);
   std::stringstream ss;
-  ss << in.rdbuf();
+  ss << std::ifstream(path).rdbuf();
   return ss.str();
 }
 
@@ -177,35 +163,29 @@ bool ServiceTest::waitForLog(const std::string& text, std::chrono::milliseconds 
   return eventually([&] { return log().find(text) != std::string::npos; }, timeout);
 }
 
+// Text columns holding a JSON object or array come back parsed.
 std::vector<nlohmann::json> ServiceTest::rows(const std::string& sql) {
   std::vector<nlohmann::json> out;
-  std::string path = stateDir_ + "/vireo.db";
-  if (!fs::exists(path)) return out;
   sqlite3* db = nullptr;
-  if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-    sqlite3_close(db);
-    return out;
-  }
-  sqlite3_busy_timeout(db, 2000);
   sqlite3_stmt* st = nullptr;
-  if (sqlite3_prepare_v2(db, sql.c_str(), -1, &st, nullptr) == SQLITE_OK) {
+  if (sqlite3_open_v2((stateDir_ + "/vireo.db").c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK &&
+      sqlite3_busy_timeout(db, 2000) == SQLITE_OK &&
+      sqlite3_prepare_v2(db, sql.c_str(), -1, &st, nullptr) == SQLITE_OK) {
     while (sqlite3_step(st) == SQLITE_ROW) {
-      nlohmann::json row = nlohmann::json::object();
+      nlohmann::json& row = out.emplace_back(nlohmann::json::object());
       for (int i = 0; i < sqlite3_column_count(st); ++i) {
-        std::string name = sqlite3_column_name(st, i);
+        nlohmann::json& cell = row[sqlite3_column_name(st, i)];
         switch (sqlite3_column_type(st, i)) {
-          case SQLITE_NULL: row[name] = nullptr; break;
-          case SQLITE_INTEGER: row[name] = static_cast<std::int64_t>(sqlite3_column_int64(st, i)); break;
-          case SQLITE_FLOAT: row[name] = sqlite3_column_double(st, i); break;
+          case SQLITE_NULL: break;
+          case SQLITE_INTEGER: cell = static_cast<std::int64_t>(sqlite3_column_int64(st, i)); break;
+          case SQLITE_FLOAT: cell = sqlite3_column_double(st, i); break;
           default: {
             std::string text = reinterpret_cast<const char*>(sqlite3_column_text(st, i));
-            auto parsed = nlohmann::json::parse(text, nullptr, false);
-            row[name] = parsed.is_discarded() || !(parsed.is_object() || parsed.is_array()) ? nlohmann::json(text)
-                                                                                            : parsed;
+            cell = nlohmann::json::parse(text, nullptr, false);
+            if (cell.is_discarded() || !(cell.is_object() || cell.is_array())) cell = text;
           }
         }
       }
-      out.push_back(std::move(row));
     }
   }
   sqlite3_finalize(st);

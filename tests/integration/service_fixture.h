@@ -30,7 +30,6 @@ class ChildProcess {
   ~ChildProcess();
   bool start(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
              const std::string& outputFile, int* stdoutPipe = nullptr);
-  pid_t pid() const { return pid_; }
   bool running();
   // Exit status (WEXITSTATUS, or 128+signal), nothing when it did not end in time.
   std::optional<int> waitExit(std::chrono::milliseconds timeout);

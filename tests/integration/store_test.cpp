@@ -165,6 +165,7 @@ TEST_F(InternalBuildTest, StopSendsTheDriverDeltaAndWritesTheSessionFile) {
   ASSERT_EQ(found.size(), 1u);
   EXPECT_EQ(found[0]["payload"]["Speaker_Underruns"], 7);
   EXPECT_FALSE(found[0]["payload"].contains("Speaker_Overloads"));
+  EXPECT_LT(found[0]["id"], messages("type = 65535")[0]["id"]);  // ahead of the summary
 
   fs::path dir = fs::path(logsDir_) / "Audio" / "Reporting";
   fs::path file;

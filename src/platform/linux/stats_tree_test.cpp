@@ -1,12 +1,8 @@
 #include "platform/linux/stats_tree.h"
 #include "fakes/temp_dir.h"
 
-#include <unistd.h>
-
 #include <cerrno>
-#include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <utility>
 
 #include <gmock/gmock.h>
@@ -20,11 +16,6 @@ using ::testing::ElementsAre;
 using ::testing::Pair;
 
 using testing::TempDir;
-
-void writeFile(const fs::path& path, const std::string& text) {
-  fs::create_directories(path.parent_path());
-  std::ofstream(path, std::ios::trunc) << text;
-}
 
 using Values = std::vector<std::pair<std::string, std::int64_t>>;
 
@@ -66,41 +57,26 @@ TEST(StatsCounterParse, AcceptsOneIntegerWithBlanksAround) {
   for (const auto& [text, value] : cases) EXPECT_EQ(parseStatsCounter(text), value) << text;
 }
 
+// A group selects its subgroups too; a subgroup alone selects it in every group, in
+// path order. Not channels: files below a subgroup, a writer's dot-file temporaries,
+// files without a group.
 TEST(StatsTreeLibrary, SelectsByGroupSubgroupOrBoth) {
   TempDir dir;
-  const fs::path stats = fs::path(dir.path()) / "stats";
-  writeFile(stats / "OrvaneTK4HB/rx", "1");
-  writeFile(stats / "OrvaneTK4HB/dsp/tx", "2");
-  writeFile(stats / "Speaker/x", "3");
-  writeFile(stats / "A/MCA/drops", "4");
-  writeFile(stats / "B/MCA/drops", "5");
-  writeFile(stats / "Haptics/Stats/on", "6");
-  writeFile(stats / "Haptics/Other/off", "7");
-  writeFile(stats / "Haptics/.on.tmp", "8");   // an atomic writer's temporary
-  writeFile(stats / "toplevel", "9");          // no group: not a channel
-  writeFile(stats / "A/MCA/deeper/z", "10");   // below a subgroup: not a channel
-  StatsTreeLibrary library(stats.string());
-
-  auto count = [&](std::optional<std::string> group, std::optional<std::string> sub) {
+  for (const char* path : {"Orvane/rx", "Orvane/dsp/tx", "A/MCA/drops", "B/MCA/drops", "A/MCA/deeper/z",
+                           "Haptics/.on.tmp", "toplevel"})
+    dir.write(std::string("stats/") + path, path[0] == 'B' ? "5" : "4");
+  StatsTreeLibrary library(dir.sub("stats"));
+  auto count = [&](std::optional<std::string> group) {
     std::optional<DriverStatsError> error;
-    auto set = library.copyChannelsInGroup(group, sub, 0, &error);
-    EXPECT_FALSE(error);
-    return library.channelCount(*set);
+    return library.channelCount(*library.copyChannelsInGroup(group, std::nullopt, 0, &error));
   };
-  EXPECT_EQ(count("OrvaneTK4HB", std::nullopt), 2);
-  EXPECT_EQ(count("Speaker", std::nullopt), 1);
-  EXPECT_EQ(count(std::nullopt, "MCA"), 2);
-  EXPECT_EQ(count("Haptics", "Stats"), 1);
-  EXPECT_EQ(count("Haptics", std::nullopt), 2);
-  EXPECT_EQ(count("Missing", std::nullopt), 0);
-  EXPECT_EQ(count(std::nullopt, std::nullopt), 7);
-
-  // Sorted by path, named by file name.
+  EXPECT_EQ(count(std::nullopt), 4);
+  EXPECT_EQ(count("Orvane"), 2);
   auto mca = subscribe(library, std::nullopt, "MCA");
   EXPECT_THAT(valuesOf(library, *sample(library, mca)), ElementsAre(Pair("drops", 4), Pair("drops", 5)));
 
   // An absent tree: an empty set and no error.
-  StatsTreeLibrary absent((fs::path(dir.path()) / "none").string());
+  StatsTreeLibrary absent(dir.sub("none"));
   std::optional<DriverStatsError> error;
   auto set = absent.copyChannelsInGroup("Speaker", std::nullopt, 0, &error);
   ASSERT_TRUE(set);
@@ -118,16 +94,13 @@ struct ForeignChannels final : DriverSubscribedChannels {
 
 TEST(StatsTreeLibrary, ReadsFilesAgainButKeepsTheChannelSetOfTheStart) {
   TempDir dir;
-  const fs::path stats = fs::path(dir.path()) / "stats";
-  const fs::path counters = fs::path(dir.path()) / "counters";
-  writeFile(stats / "Speaker/a", "10\n");
-  writeFile(stats / "Speaker/bad", "n/a\n");
-  writeFile(stats / "Speaker/gone", "5\n");
-  writeFile(stats / "Speaker/big", "-9223372036854775807");
-  writeFile(counters / "real", "7\n");
+  const fs::path stats = fs::path(dir.path()) / "stats", counters = fs::path(dir.path()) / "counters";
+  for (auto [path, text] : {std::pair{"stats/Speaker/a", "10\n"}, {"stats/Speaker/bad", "n/a\n"},
+                            {"stats/Speaker/gone", "5\n"}, {"stats/Speaker/big", "-9223372036854775807"},
+                            {"counters/real", "7\n"}, {"counters/hw/x", "3\n"}})
+    dir.write(path, text);
   fs::create_symlink(counters / "real", stats / "Speaker/linked");
   fs::create_symlink(counters / "later", stats / "Speaker/pending");  // its counter does not exist yet
-  writeFile(counters / "hw/x", "3\n");
   fs::create_symlink(counters / "hw", stats / "Speaker/hw");           // a symlinked subgroup
   StatsTreeLibrary library(stats.string());
   auto s = subscribe(library, "Speaker", std::nullopt);
@@ -136,13 +109,12 @@ TEST(StatsTreeLibrary, ReadsFilesAgainButKeepsTheChannelSetOfTheStart) {
   EXPECT_THAT(valuesOf(library, *before),
               ElementsAre(Pair("a", 10), Pair("big", -INT64_MAX), Pair("gone", 5), Pair("x", 3), Pair("linked", 7)));
 
-  writeFile(stats / "Speaker/a", "4\n");
-  writeFile(stats / "Speaker/bad", "12\n");
-  writeFile(stats / "Speaker/new", "1\n");  // not part of the set fixed at start
+  // "new" is not part of the set fixed at the start.
+  for (auto [path, text] : {std::pair{"stats/Speaker/a", "4\n"}, {"stats/Speaker/bad", "12\n"},
+                            {"stats/Speaker/new", "1\n"}, {"counters/real", "9\n"}, {"counters/later", "2\n"},
+                            {"stats/Speaker/big", "9223372036854775807"}})
+    dir.write(path, text);
   fs::remove(stats / "Speaker/gone");
-  writeFile(counters / "real", "9\n");
-  writeFile(counters / "later", "2\n");
-  writeFile(stats / "Speaker/big", "9223372036854775807");
   auto after = sample(library, s);
   EXPECT_THAT(valuesOf(library, *after), ElementsAre(Pair("a", 4), Pair("bad", 12), Pair("big", INT64_MAX), Pair("x", 3),
                                                      Pair("linked", 9), Pair("pending", 2)));
