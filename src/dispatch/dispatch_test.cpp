@@ -75,14 +75,20 @@ TEST(SerialQueue, NeverRunsTwoClosuresOfOneQueueAtOnceUnderStress) {
       std::mt19937 rng(static_cast<unsigned>(p));
       for (int seq = 0; seq < kPerProducer; ++seq) {
         State& s = states[rng() % kQueues];
-        s.queue->async([&s, &overlaps, &reorders, &ran, p, seq] {
+        Task closure = [&s, &overlaps, &reorders, &ran, p, seq] {
           if (s.inFlight.fetch_add(1) != 0) ++overlaps;
           if (s.lastSeq[p] >= seq) ++reorders;
           s.lastSeq[p] = seq;
           if (seq % 97 == 0) std::this_thread::yield();
           s.inFlight.fetch_sub(1);
           ++ran;
-        });
+        };
+        // Half run on the producer itself whenever their queue is idle.
+        if (seq % 2) {
+          s.queue->asyncOrRun(std::move(closure));
+        } else {
+          s.queue->async(std::move(closure));
+        }
       }
     });
   }
@@ -91,6 +97,33 @@ TEST(SerialQueue, NeverRunsTwoClosuresOfOneQueueAtOnceUnderStress) {
   EXPECT_EQ(ran.load(), kProducers * kPerProducer);
   EXPECT_EQ(overlaps.load(), 0);
   EXPECT_EQ(reorders.load(), 0);
+}
+
+TEST(SerialQueue, AsyncOrRunRunsOnTheCallerOnlyWhenTheQueueIsIdle) {
+  ThreadPoolDispatcher pool({.workers = 2});
+  auto queue = pool.makeSerialQueue("q", QoS::Default);
+  const auto caller = std::this_thread::get_id();
+  std::thread::id ranOn;
+  queue->asyncOrRun([&] { ranOn = std::this_thread::get_id(); });
+  EXPECT_EQ(ranOn, caller);
+
+  // Busy: it waits its turn on the pool, behind the closure that holds the queue.
+  Countdown release(1), done(1);
+  Trail trail;
+  queue->async([&] {
+    release.wait();
+    trail.add("first");
+  });
+  queue->asyncOrRun([&] {
+    trail.add("second");
+    ranOn = std::this_thread::get_id();
+    done.arrive();
+  });
+  EXPECT_TRUE(trail().empty());
+  release.arrive();
+  ASSERT_TRUE(done.wait());
+  EXPECT_EQ(trail(), (std::vector<std::string>{"first", "second"}));
+  EXPECT_NE(ranOn, caller);
 }
 
 // Two workers, ten thousand parked queues: another queue still gets a thread. A
