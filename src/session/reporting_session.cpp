@@ -194,8 +194,10 @@ void VRReportingSession::sendMessage(const Dictionary& message, std::uint32_t ca
   const bool submittedWhileStarted = started_.load();
   // The message as received only appears in a debug line.
   Value received = env_->logger().verbose(LogScope::Session) ? Value(message) : Value();
-  skylarkReportingQueue_->async([self = shared_from_this(), cleaned, received = std::move(received),
-                                 submittedWhileStarted, category, type] {
+  // Handing a row to the store is quick: on an idle queue it is done here, without
+  // waking a pool thread.
+  skylarkReportingQueue_->asyncOrRun([self = shared_from_this(), cleaned, received = std::move(received),
+                                      submittedWhileStarted, category, type] {
     self->deliver(*cleaned.asDictionary(), received, submittedWhileStarted, category, type);
   });
   if (reply) reply(false);

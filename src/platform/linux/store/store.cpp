@@ -256,10 +256,11 @@ bool LocalStore::enqueue(Row&& row) {
       row.number = ++enqueued_;
       ++pendingRows_;
       pendingBytes_ += row.size;
-      // The writer sleeps only on an empty queue; while it writes or pauses after
-      // a failure it picks the rows up by itself.
-      wake = queue_.empty();
+      if (queue_.empty()) queuedSince_ = std::chrono::steady_clock::now();
       queue_.push_back(std::move(row));
+      // The writer sleeps on an empty queue or while a group gathers; while it writes
+      // or pauses after a failure it picks the rows up by itself.
+      wake = queue_.size() == 1 || queue_.size() == options_.groupRows;
     }
   }
   if (logOverflow) {
@@ -429,6 +430,10 @@ void LocalStore::writerLoop() {
   for (;;) {
     if (failures == 0) {
       while (!stopping_ && queue_.empty()) lock.wait(wake_);
+      const auto until = queuedSince_ + options_.groupWindow;
+      while (!stopping_ && queue_.size() < options_.groupRows &&
+             lock.waitUntil(wake_, until) == std::cv_status::no_timeout) {
+      }
     } else {
       // Only close() cuts the pause short, for one attempt at once.
       const bool wasStopping = stopping_;

@@ -56,6 +56,11 @@ class LocalStore {
     // How long close() keeps retrying a failing write before it drops the rows
     // (a write already waiting on a lock may add up to busyTimeout).
     std::chrono::milliseconds closeTimeout{5000};
+    // Group commit: a row that finds the writer idle waits this long for others to
+    // join its transaction (unless groupRows are already waiting), so that a steady
+    // trickle of rows costs a commit every few milliseconds rather than one per row.
+    std::chrono::microseconds groupWindow{2000};
+    std::size_t groupRows = 256;
   };
 
   // Opens (creating it and its directory) STATE/vireo.db. A store that cannot be
@@ -143,7 +148,8 @@ class LocalStore {
   mutable Mutex mutex_;
   std::condition_variable wake_;      // the writer: rows, stop
   std::condition_variable processed_; // flush() waiters
-  std::vector<Row> queue_ VIREO_GUARDED_BY(mutex_);            // not yet taken by the writer
+  std::vector<Row> queue_ VIREO_GUARDED_BY(mutex_);
+  std::chrono::steady_clock::time_point queuedSince_ VIREO_GUARDED_BY(mutex_);  // when queue_ last became non-empty            // not yet taken by the writer
   std::uint64_t pendingRows_ VIREO_GUARDED_BY(mutex_) = 0;     // queue_ and the writer's batch
   std::uint64_t pendingBytes_ VIREO_GUARDED_BY(mutex_) = 0;
   std::uint64_t enqueued_ VIREO_GUARDED_BY(mutex_) = 0;        // rows handed over, ever
