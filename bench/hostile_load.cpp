@@ -76,23 +76,8 @@ bool alive(pid_t pid) {
 // Read-only queries of the daemon's store; -1 when it cannot be read.
 class Store {
  public:
-  explicit Store(const std::string& path) {
-    if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-      sqlite3_close(db_);
-      db_ = nullptr;
-    } else {
-      sqlite3_busy_timeout(db_, 2000);
-    }
-  }
-  ~Store() { sqlite3_close(db_); }
-  std::int64_t number(const std::string& sql) {
-    sqlite3_stmt* st = nullptr;
-    std::int64_t n = -1;
-    if (db_ && sqlite3_prepare_v2(db_, sql.c_str(), -1, &st, nullptr) == SQLITE_OK && sqlite3_step(st) == SQLITE_ROW)
-      n = sqlite3_column_int64(st, 0);
-    sqlite3_finalize(st);
-    return n;
-  }
+  explicit Store(const std::string& path) : store_(path, 2000) {}
+  std::int64_t number(const std::string& sql) { return store_.scalar(sql); }
   std::int64_t maxId(const char* table) { return number(std::string("SELECT IFNULL(MAX(id), 0) FROM ") + table); }
   // Polls sql until it gives want, or stops moving for `quiet`, or the deadline passes.
   std::int64_t await(const std::string& sql, std::int64_t want, std::chrono::seconds deadline, Clock::duration quiet) {
@@ -119,7 +104,7 @@ class Store {
   }
 
  private:
-  sqlite3* db_ = nullptr;
+  bench::ReadOnlyStore store_;
 };
 
 struct Env {

@@ -2,6 +2,7 @@
 // process id and CPU time, and a barrier to start client threads together.
 #pragma once
 
+#include <sqlite3.h>
 #include <systemd/sd-bus.h>
 #include <unistd.h>
 
@@ -101,9 +102,9 @@ inline std::optional<pid_t> daemonPid(sd_bus* bus) {
   return static_cast<pid_t>(pid);
 }
 
-// utime + stime of a process in seconds.
-inline std::optional<double> cpuSeconds(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+// utime + stime in seconds from a /proc stat file (a process's or one thread's).
+inline std::optional<double> cpuSecondsOf(const std::string& statPath) {
+  std::ifstream in(statPath);
   std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
   auto close = text.rfind(')');
   if (close == std::string::npos) return std::nullopt;
@@ -117,6 +118,44 @@ inline std::optional<double> cpuSeconds(pid_t pid) {
   }
   return static_cast<double>(utime + stime) / static_cast<double>(sysconf(_SC_CLK_TCK));
 }
+inline std::optional<double> cpuSeconds(pid_t pid) { return cpuSecondsOf("/proc/" + std::to_string(pid) + "/stat"); }
+// One thread of this process.
+inline std::optional<double> threadCpuSeconds(pid_t tid) {
+  return cpuSecondsOf("/proc/self/task/" + std::to_string(tid) + "/stat");
+}
+
+// The daemon's store, opened read-only beside it (WAL readers do not block its writer).
+class ReadOnlyStore {
+ public:
+  ReadOnlyStore(const std::string& path, int busyMs) {
+    if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
+      sqlite3_close(db_);
+      db_ = nullptr;
+    } else {
+      sqlite3_busy_timeout(db_, busyMs);
+    }
+  }
+  ~ReadOnlyStore() { sqlite3_close(db_); }
+  ReadOnlyStore(const ReadOnlyStore&) = delete;
+  ReadOnlyStore& operator=(const ReadOnlyStore&) = delete;
+
+  // The first column of the first row; ?1, when the query has it, is arg. -1 when the
+  // store cannot be read.
+  std::int64_t scalar(const std::string& sql, std::int64_t arg = 0) {
+    if (!db_) return -1;
+    sqlite3_stmt* st = nullptr;
+    std::int64_t n = -1;
+    if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &st, nullptr) == SQLITE_OK &&
+        (sqlite3_bind_parameter_count(st) == 0 || sqlite3_bind_int64(st, 1, arg) == SQLITE_OK) &&
+        sqlite3_step(st) == SQLITE_ROW)
+      n = sqlite3_column_int64(st, 0);
+    sqlite3_finalize(st);
+    return n;
+  }
+
+ private:
+  sqlite3* db_ = nullptr;
+};
 
 // Releases every waiting client thread at once.
 class StartGate {

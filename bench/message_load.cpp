@@ -59,22 +59,6 @@ Dictionary makePayload() {
   return d;
 }
 
-// utime + stime of one thread of this process, in seconds.
-std::optional<double> threadCpuSeconds(pid_t tid) {
-  std::ifstream in("/proc/self/task/" + std::to_string(tid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  auto close = text.rfind(')');
-  if (close == std::string::npos) return std::nullopt;
-  std::istringstream fields(text.substr(close + 2));
-  std::string f;
-  unsigned long long utime = 0, stime = 0;
-  for (int i = 3; i <= 15 && fields >> f; ++i) {
-    if (i == 14) utime = std::stoull(f);
-    if (i == 15) stime = std::stoull(f);
-  }
-  return static_cast<double>(utime + stime) / static_cast<double>(sysconf(_SC_CLK_TCK));
-}
-
 // Builds one call; the bus connection is the caller's.
 using MakeCall = std::function<int(sd_bus*, sd_bus_message**)>;
 
@@ -260,7 +244,7 @@ class DiscardServer {
   }
   const std::string& name() const { return name_; }
   // The serving thread's CPU time, for the floor's CPU per message.
-  std::optional<double> cpuSeconds() const { return threadCpuSeconds(tid_.load()); }
+  std::optional<double> cpuSeconds() const { return bench::threadCpuSeconds(tid_.load()); }
 
  private:
   static int discard(sd_bus_message* m, void*, sd_bus_error* error) {
@@ -287,20 +271,12 @@ class DiscardServer {
 // is a row too (type 0xFFFF) and may land in the next phase.
 class StoreCounter {
  public:
-  explicit StoreCounter(const std::string& path) {
-    if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-      sqlite3_close(db_);
-      db_ = nullptr;
-    } else {
-      sqlite3_busy_timeout(db_, 1000);
-    }
-  }
-  ~StoreCounter() { sqlite3_close(db_); }
+  explicit StoreCounter(const std::string& path) : store_(path, 1000) {}
   bool readable() { return lastId() >= 0; }
   // The highest id stored, 0 when empty, -1 when the store cannot be read.
-  std::int64_t lastId() { return scalar("SELECT COALESCE(MAX(id), 0) FROM telemetry_messages", 0); }
+  std::int64_t lastId() { return store_.scalar("SELECT COALESCE(MAX(id), 0) FROM telemetry_messages", 0); }
   std::int64_t rowsAfter(std::int64_t id) {
-    return scalar("SELECT COUNT(*) FROM telemetry_messages WHERE id > ?1 AND type = " + std::to_string(kType), id);
+    return store_.scalar("SELECT COUNT(*) FROM telemetry_messages WHERE id > ?1 AND type = " + std::to_string(kType), id);
   }
   // Polls until at least want rows are above id or the deadline passes; the count seen.
   std::int64_t waitRows(std::int64_t id, std::int64_t want, Clock::time_point deadline) {
@@ -323,18 +299,7 @@ class StoreCounter {
   }
 
  private:
-  std::int64_t scalar(const std::string& sql, std::int64_t arg) {
-    if (!db_) return -1;
-    sqlite3_stmt* st = nullptr;
-    std::int64_t n = -1;
-    if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &st, nullptr) == SQLITE_OK &&
-        (sqlite3_bind_parameter_count(st) == 0 || sqlite3_bind_int64(st, 1, arg) == SQLITE_OK) &&
-        sqlite3_step(st) == SQLITE_ROW)
-      n = sqlite3_column_int64(st, 0);
-    sqlite3_finalize(st);
-    return n;
-  }
-  sqlite3* db_ = nullptr;
+  bench::ReadOnlyStore store_;
 };
 
 struct Phase {
