@@ -490,28 +490,30 @@ bool appendJson(std::string& out, const Value& v, JsonMode mode, bool pretty, Js
       out += ']';
       return true;
     }
-    case Value::Kind::Dictionary: {
-      const auto& d = *v.asDictionary();
-      out += '{';
-      bool first = true;
-      for (const auto& [k, val] : d) {
-        if (!first) out += ',';
-        first = false;
-        newline(out, pretty, indent + 1);
-        if (const auto* s = k.asString()) {
-          appendJsonString(out, *s);
-        } else {
-          if (strict) return refuse(error, "Invalid (non-string) key in JSON dictionary");
-          appendJsonString(out, k.text());
-        }
-        out += pretty ? " : " : ":";
-        if (!appendJson(out, val, mode, pretty, error, indent + 1)) return false;
-      }
-      if (!d.empty()) newline(out, pretty, indent);
-      out += '}';
-      return true;
-    }
+    case Value::Kind::Dictionary:
+      return appendJson(out, *v.asDictionary(), mode, pretty, error, indent);
   }
+  return true;
+}
+
+bool appendJson(std::string& out, const Dictionary& d, JsonMode mode, bool pretty, JsonError* error, int indent) {
+  out += '{';
+  bool first = true;
+  for (const auto& [k, val] : d) {
+    if (!first) out += ',';
+    first = false;
+    newline(out, pretty, indent + 1);
+    if (const auto* s = k.asString()) {
+      appendJsonString(out, *s);
+    } else {
+      if (mode == JsonMode::Strict) return refuse(error, "Invalid (non-string) key in JSON dictionary");
+      appendJsonString(out, k.text());
+    }
+    out += pretty ? " : " : ":";
+    if (!appendJson(out, val, mode, pretty, error, indent + 1)) return false;
+  }
+  if (!d.empty()) newline(out, pretty, indent);
+  out += '}';
   return true;
 }
 

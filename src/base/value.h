@@ -148,6 +148,9 @@ struct JsonError {
 // Returns false and fills error (if given) when strict mode refuses the value.
 bool appendJson(std::string& out, const Value& v, JsonMode mode, bool pretty, JsonError* error = nullptr,
                 int indent = 0);
+// The same for a dictionary held directly, without wrapping (copying) it in a Value.
+bool appendJson(std::string& out, const Dictionary& d, JsonMode mode, bool pretty, JsonError* error = nullptr,
+                int indent = 0);
 std::optional<std::string> toJson(const Value& v, JsonMode mode, bool pretty = false, JsonError* error = nullptr);
 
 std::string base64Encode(const Data& data);

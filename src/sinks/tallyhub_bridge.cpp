@@ -18,7 +18,8 @@ void VRReportingTallyhubBridge::handleEvent(const std::shared_ptr<ReportingEnvir
   const Dictionary info = session.userInfo();
   payload.set(Value(kHostApplicationDisplayIDKey), VRReportingHostApplicationDisplayID(&info));
   const std::string name = "com.orvane.vireo." + VRReportingCategoryName(category) + "." + VRReportingTypeName(type);
-  env->platform.analytics.sendEventLazy(name, [payload = std::move(payload)] { return payload; });
+  // Built once, handed over once.
+  env->platform.analytics.sendEventLazy(name, [payload = std::move(payload)]() mutable { return std::move(payload); });
 }
 
 }  // namespace vireo

@@ -223,8 +223,8 @@ void LocalStore::finalizeDatabase() {
 }
 
 std::string LocalStore::jsonObject(const Dictionary& d) {
-  auto json = toJson(Value(d), JsonMode::Lenient);
-  return json ? std::move(*json) : std::string("{}");
+  std::string json;
+  return appendJson(json, d, JsonMode::Lenient, false) ? json : std::string("{}");
 }
 
 bool LocalStore::refuse() {
