@@ -93,14 +93,8 @@ class Store {
   }
   // Until every table stops growing, so one scenario's rows do not count in the next.
   void settle() {
-    auto total = [&] { return maxId("telemetry_sessions") + maxId("telemetry_messages") + maxId("analytics_events"); };
-    std::int64_t last = total();
-    for (int still = 0; still < 3;) {
-      std::this_thread::sleep_for(200ms);
-      std::int64_t now = total();
-      still = now == last ? still + 1 : 0;
-      last = now;
-    }
+    bench::waitUntilStill(
+        [&] { return maxId("telemetry_sessions") + maxId("telemetry_messages") + maxId("analytics_events"); }, 200ms);
   }
 
  private:

@@ -13,12 +13,14 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <functional>
 #include <map>
 #include <mutex>
 #include <optional>
 #include <sstream>
 #include <memory>
 #include <string>
+#include <thread>
 
 #include "vireo/client.h"
 
@@ -122,6 +124,18 @@ inline std::optional<double> cpuSeconds(pid_t pid) { return cpuSecondsOf("/proc/
 // One thread of this process.
 inline std::optional<double> threadCpuSeconds(pid_t tid) {
   return cpuSecondsOf("/proc/self/task/" + std::to_string(tid) + "/stat");
+}
+
+// Waits until read() gives the same figure three times in a row, step apart: the
+// store has taken the rows of a phase that were still on their way.
+inline void waitUntilStill(const std::function<std::int64_t()>& read, std::chrono::milliseconds step) {
+  std::int64_t last = read();
+  for (int still = 0; still < 3;) {
+    std::this_thread::sleep_for(step);
+    const std::int64_t now = read();
+    still = now == last ? still + 1 : 0;
+    last = now;
+  }
 }
 
 // The daemon's store, opened read-only beside it (WAL readers do not block its writer).

@@ -289,13 +289,7 @@ class StoreCounter {
   }
   // Waits until the count stops moving, so late rows of a phase do not count in the next.
   void settle() {
-    std::int64_t last = lastId();
-    for (int quiet = 0; quiet < 3;) {
-      std::this_thread::sleep_for(150ms);
-      std::int64_t now = lastId();
-      quiet = now == last ? quiet + 1 : 0;
-      last = now;
-    }
+    bench::waitUntilStill([this] { return lastId(); }, 150ms);
   }
 
  private:
