@@ -505,7 +505,7 @@ bool scenarioFlood(const Env& env, std::size_t messages, std::size_t window) {
       "== 3. One session, %zu messages of a 20-entry payload (compact JSON %zu bytes) addressed to it,\n"
       "   %zu in flight, then stopped. RSS (MiB, sampled every 10 ms) before the session, peak while\n"
       "   sending, right after the stop answer, peak and last within 1 s after it; 'back' is when RSS\n"
-      "   first came within 10%% of before (target, an issue: within 1 s). growth/msg = (peak while\n"
+      "   first came within 10%% of before (target: within 1 s). growth/msg = (peak while\n"
       "   sending - before) / accepted. stored: the session's type-1 rows in telemetry_messages.\n\n",
       messages, jsonBytes, window);
   std::printf("  %-4s %8s %6s %7s %6s %6s %7s %6s %6s %7s %8s %7s %8s\n", "rep", "accepted", "failed", "msgs/s",
