@@ -1,4 +1,3 @@
-#include "base/mutex.h"
 #include "vireo/client.h"
 
 #include <poll.h>
@@ -10,6 +9,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "base/mutex.h"
 #include "platform/dbus/value_codec.h"
 
 namespace vireo::client {

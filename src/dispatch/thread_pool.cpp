@@ -1,4 +1,3 @@
-#include "base/mutex.h"
 #include "dispatch/thread_pool.h"
 
 #include <algorithm>
@@ -10,6 +9,8 @@
 #include <system_error>
 #include <thread>
 #include <vector>
+
+#include "base/mutex.h"
 
 namespace vireo {
 
