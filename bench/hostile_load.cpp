@@ -490,16 +490,8 @@ bool scenarioVanish(const Env& env, std::size_t clients, std::size_t parallel) {
 
 // ---------------------------------------------------------------- 3. flood
 
-Dictionary makePayload() {
-  Dictionary d;
-  for (int i = 0; i < 7; ++i) d.set(Value("string_" + std::to_string(i)), Value("value of entry " + std::to_string(i)));
-  for (int i = 0; i < 7; ++i) d.set(Value("int_" + std::to_string(i)), Value(1234567890123LL * (i + 1)));
-  for (int i = 0; i < 6; ++i) d.set(Value("double_" + std::to_string(i)), Value(3.14159 * (i + 1)));
-  return d;
-}
-
 bool scenarioFlood(const Env& env, std::size_t messages, std::size_t window) {
-  const Dictionary payload = makePayload();
+  const Dictionary payload = bench::makePayload();
   const std::size_t jsonBytes = toJson(Value(payload), JsonMode::Lenient).value_or("").size();
   std::printf(
       "== 3. One session, %zu messages of a 20-entry payload (compact JSON %zu bytes) addressed to it,\n"

@@ -22,6 +22,7 @@
 #include <string>
 #include <thread>
 
+#include "base/value.h"
 #include "vireo/client.h"
 
 namespace vireo::bench {
@@ -124,6 +125,15 @@ inline std::optional<double> cpuSeconds(pid_t pid) { return cpuSecondsOf("/proc/
 // One thread of this process.
 inline std::optional<double> threadCpuSeconds(pid_t tid) {
   return cpuSecondsOf("/proc/self/task/" + std::to_string(tid) + "/stat");
+}
+
+// The payload of the message loads: 20 entries (7 strings, 7 64-bit integers, 6 doubles).
+inline Dictionary makePayload() {
+  Dictionary d;
+  for (int i = 0; i < 7; ++i) d.set(Value("string_" + std::to_string(i)), Value("value of entry " + std::to_string(i)));
+  for (int i = 0; i < 7; ++i) d.set(Value("int_" + std::to_string(i)), Value(1234567890123LL * (i + 1)));
+  for (int i = 0; i < 6; ++i) d.set(Value("double_" + std::to_string(i)), Value(3.14159 * (i + 1)));
+  return d;
 }
 
 // Waits until read() gives the same figure three times in a row, step apart: the

@@ -51,14 +51,6 @@ constexpr std::uint16_t kType = 1;
 constexpr const char* kBenchPath = "/com/orvane/vireo/Bench1";
 constexpr const char* kBenchInterface = "com.orvane.vireo.Bench1";
 
-Dictionary makePayload() {
-  Dictionary d;
-  for (int i = 0; i < 7; ++i) d.set(Value("string_" + std::to_string(i)), Value("value of entry " + std::to_string(i)));
-  for (int i = 0; i < 7; ++i) d.set(Value("int_" + std::to_string(i)), Value(1234567890123LL * (i + 1)));
-  for (int i = 0; i < 6; ++i) d.set(Value("double_" + std::to_string(i)), Value(3.14159 * (i + 1)));
-  return d;
-}
-
 // Builds one call; the bus connection is the caller's.
 using MakeCall = std::function<int(sd_bus*, sd_bus_message**)>;
 
@@ -463,7 +455,7 @@ int main(int argc, char** argv) {
     store.reset();
   }
   DiscardServer discard(address);
-  const Dictionary payload = makePayload();
+  const Dictionary payload = bench::makePayload();
   const CpuClock daemonCpu = [&] { return bench::cpuSeconds(*pid); };
   const CpuClock floorCpu = [&] { return discard.cpuSeconds(); };
 
