@@ -10,6 +10,9 @@
 //    each abandoned session leaves in the store.
 // 3. flood: one session given many pipelined messages; the daemon's RSS before,
 //    during and after, against the size of one payload.
+// 4. idle: thousands of sessions started and left idle: RSS per session, the daemon's
+//    threads, and a probe session's send-to-store latency meanwhile.
+// 5. wait: the same while every new session waits out its backend interval.
 //
 // Every figure is per repetition, then the median over the repetitions.
 #include <signal.h>
@@ -30,16 +33,19 @@ namespace {
 using namespace vireo;
 using namespace std::chrono_literals;
 using Clock = std::chrono::steady_clock;
+using bench::rssMiB;
 
 constexpr const char* kUsage = R"(usage: hostile_load [--repetitions R] [--scenarios ping,vanish,flood] [options]
   --repetitions R   repetitions of each scenario, at least 3 (default 3)
-  --scenarios S     comma-separated subset of ping,vanish,flood (default all)
+  --scenarios S     comma-separated subset of ping,vanish,flood,idle,wait (default all)
   --seconds S       ping: seconds of pinging per phase, floor and load (default 10)
   --hostile N       ping: hostile connections, one thread each (default 4)
   --clients N       vanish: clients that start a session and disconnect (default 12000)
   --parallel N      vanish: clients at a time (default 8)
   --messages N      flood: messages into the one session (default 150000)
   --window W        flood: calls in flight (default 64)
+  --sessions N      idle, wait: sessions created and started (default 10000)
+  --per-client N    idle, wait: sessions of each client (default 50)
   --address A       D-Bus address (default: VIREO_BUS, else system for root, session otherwise)
   --db PATH         the daemon's store (default STATE_DIRECTORY/vireo.db)
   --pid PID         the daemon's process (default: asked from the bus)
@@ -56,14 +62,6 @@ double percentile(std::vector<double> v, double p) {
   return v[static_cast<std::size_t>(p * static_cast<double>(v.size() - 1) + 0.5)];
 }
 double median(std::vector<double> v) { return percentile(std::move(v), 0.5); }
-
-// VmRSS of a process in MiB; 0 when it cannot be read (the process is gone).
-double rssMiB(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/status");
-  for (std::string line; std::getline(in, line);)
-    if (line.rfind("VmRSS:", 0) == 0) return std::atof(line.c_str() + 6) / 1024.0;
-  return 0;
-}
 
 // Alive and not a zombie waiting for its parent.
 bool alive(pid_t pid) {
@@ -584,6 +582,131 @@ bool scenarioFlood(const Env& env, std::size_t messages, std::size_t window) {
   return up;
 }
 
+
+// ---------------------------------------------------------------- 4. idle
+//
+// sessions created and started (without asking for the start's answer) by clients of
+// perClient sessions each, then left idle. With wait, telemetry.conf says Backends=none
+// during the burst, so every new session's queue waits out its backend interval. A
+// probe session started before the burst sends one message every 20 ms throughout; its
+// latency is from the send to its row being readable in the store.
+
+bool scenarioIdle(const Env& env, std::size_t sessions, std::size_t perClient, std::size_t parallel, bool wait) {
+  const std::size_t clientCount = (sessions + perClient - 1) / perClient;
+  std::printf(
+      "== %s. %zu sessions created and started by %zu clients (%zu each), then left idle%s.\n"
+      "   RSS per session = (RSS idle - RSS before the clients connected) / sessions (target <= 4 KiB);\n"
+      "   threads: the daemon's peak, sampled every 10 ms (target <= 12). A probe session started\n"
+      "   before the burst sends every 20 ms; probe ms = send to its row readable in the store,\n"
+      "   before the burst and from the burst to %s after it (target: no stall over 100 ms).\n\n",
+      wait ? "5. wait" : "4. idle", sessions, clientCount, perClient,
+      wait ? ", each waiting for backends (Backends=none)" : "", wait ? "9.5 s" : "1 s");
+  std::printf("  %-4s %7s %6s %8s %8s %7s %6s %7s | %6s %6s | %6s %6s %6s %6s\n", "rep", "burst s", "errors", "RSS0 MiB",
+              "idle MiB", "B/sess", "target", "threads", "target", "end", "p50 0", "p99 0", "p50", "max");
+  const std::string conf = linux_platform::ServiceDirectories::fromEnvironment().configuration + "/telemetry.conf";
+  std::vector<double> burst, rss0, rssIdle, perSession, threadsPeak, rssEnd, p50Before, p99Before, p50During,
+      maxDuring;
+  bool met = true;
+  for (int rep = 1; rep <= env.repetitions && alive(env.pid); ++rep) {
+    if (env.store) env.store->settle();
+    const double base = rssMiB(env.pid);
+    const std::int64_t s0 = env.store ? env.store->maxId("telemetry_sessions") : 0;
+    auto probe = bench::connectClient(env.address);
+    const std::int64_t probeId = 0x7100 + rep;
+    probe->createReportingSession(probeId);
+    probe->startReportingSessionForIDNoWait(probeId);
+    // By row id from where this repetition starts, so the poll stays cheap in a big store.
+    const std::string probeRows =
+        "SELECT COUNT(*) FROM telemetry_messages WHERE id > " +
+        std::to_string(env.store ? env.store->maxId("telemetry_messages") : 0) +
+        " AND type = 1 AND session = (SELECT MIN(id) FROM telemetry_sessions WHERE id > " + std::to_string(s0) + ")";
+    const Dictionary payload = bench::makePayload();
+    const std::vector<std::int64_t> to{probeId};
+    // Phase 0: floor, 1: burst and after, 2: done.
+    std::atomic<int> phase{0};
+    std::vector<double> lat[2];
+    std::thread prober([&] {
+      std::int64_t stored = env.store ? env.store->number(probeRows) : 0;
+      for (int ph; (ph = phase.load()) < 2; std::this_thread::sleep_for(20ms)) {
+        auto t0 = Clock::now();
+        if (!probe->sendMessage(payload, kCategory, 1, to)) continue;
+        while (env.store && env.store->number(probeRows) <= stored && Clock::now() - t0 < 30s)
+          std::this_thread::sleep_for(1ms);
+        ++stored;
+        lat[ph].push_back(ms(Clock::now() - t0));
+      }
+    });
+    std::atomic<double> peakThreads{bench::procStatus(env.pid, "Threads")};
+    std::atomic<bool> sampling{true};
+    std::thread sampler([&] {
+      for (; sampling; std::this_thread::sleep_for(10ms))
+        peakThreads = std::max(peakThreads.load(), bench::procStatus(env.pid, "Threads"));
+    });
+    std::this_thread::sleep_for(1s);
+
+    std::string saved;
+    bool hadConf = false;
+    if (wait) {
+      std::ifstream in(conf);
+      hadConf = in.good();
+      saved.assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+      std::ofstream(conf) << "Backends=none\n";
+    }
+    std::vector<std::unique_ptr<client::Client>> clients(clientCount);
+    std::atomic<std::size_t> next{0}, errors{0};
+    phase = 1;
+    auto t0 = Clock::now();
+    std::vector<std::thread> threads;
+    for (std::size_t t = 0; t < parallel; ++t)
+      threads.emplace_back([&] {
+        for (std::size_t c; (c = next++) < clientCount;) {
+          clients[c] = bench::connectClient(env.address);
+          for (std::size_t k = 0; k < perClient && c * perClient + k < sessions; ++k) {
+            const auto id = static_cast<std::int64_t>(1000000 * rep + c * perClient + k);
+            if (!clients[c]->createReportingSession(id) || !clients[c]->startReportingSessionForIDNoWait(id)) ++errors;
+          }
+          if (!clients[c]->getAllReporters()) ++errors;  // every start has been handled
+        }
+      });
+    for (auto& t : threads) t.join();
+    burst.push_back(ms(Clock::now() - t0) / 1000);
+    if (wait) {
+      if (hadConf)
+        std::ofstream(conf) << saved;
+      else
+        std::remove(conf.c_str());
+    }
+    std::this_thread::sleep_for(wait ? 9500ms : 1s);  // the last wait ends 9 s after its start
+    const double idle = rssMiB(env.pid);
+    phase = 2;
+    prober.join();
+    clients.clear();  // gone: the daemon stops and drops their sessions
+    probe.reset();
+    if (env.store) env.store->settle();
+    std::this_thread::sleep_for(1s);
+    sampling = false;
+    sampler.join();
+    rss0.push_back(base), rssIdle.push_back(idle), rssEnd.push_back(rssMiB(env.pid));
+    perSession.push_back((idle - base) * 1048576.0 / static_cast<double>(sessions));
+    threadsPeak.push_back(peakThreads.load());
+    p50Before.push_back(percentile(lat[0], 0.5)), p99Before.push_back(percentile(lat[0], 0.99));
+    p50During.push_back(percentile(lat[1], 0.5)), maxDuring.push_back(percentile(lat[1], 1.0));
+    const bool memOk = perSession.back() <= 4096, threadsOk = threadsPeak.back() <= 12, probeOk = maxDuring.back() <= 100;
+    met = met && memOk && threadsOk && probeOk;
+    std::printf("  %-4d %7.1f %6zu %8.1f %8.1f %7.0f %6s %7.0f | %6s %6.1f | %6.1f %6.1f %6.1f %6.1f%s\n", rep,
+                burst.back(), errors.load(), base, idle, perSession.back(), memOk ? "met" : "MISSED",
+                threadsPeak.back(), threadsOk ? "met" : "MISSED", rssEnd.back(), p50Before.back(), p99Before.back(),
+                p50During.back(), maxDuring.back(), probeOk ? "" : "  (probe stalled)");
+  }
+  std::printf("  %-4s %7.1f %6s %8.1f %8.1f %7.0f %6s %7.0f | %6s %6.1f | %6.1f %6.1f %6.1f %6.1f\n", "med",
+              median(burst), "", median(rss0), median(rssIdle), median(perSession), "", median(threadsPeak), "",
+              median(rssEnd), median(p50Before), median(p99Before), median(p50During), median(maxDuring));
+  const bool up = alive(env.pid);
+  std::printf("\n  targets (<= 4 KiB per session, <= 12 threads, probe under 100 ms): %s; daemon alive after: %s\n\n",
+              met ? "met" : "MISSED", up ? "yes" : "NO");
+  return up;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -592,7 +715,7 @@ int main(int argc, char** argv) {
   Env env;
   env.address = opt.text("address", "");
   env.repetitions = static_cast<int>(std::max(3LL, opt.number("repetitions", 3)));
-  const std::string scenarios = "," + opt.text("scenarios", "ping,vanish,flood") + ",";
+  const std::string scenarios = "," + opt.text("scenarios", "ping,vanish,flood,idle,wait") + ",";
   const std::string dbPath = opt.text("db", linux_platform::ServiceDirectories::fromEnvironment().state + "/vireo.db");
 
   sd_bus* bus = bench::openBus(env.address);
@@ -624,6 +747,11 @@ int main(int argc, char** argv) {
   if (up && scenarios.find(",flood,") != std::string::npos)
     up = scenarioFlood(env, static_cast<std::size_t>(std::max(1LL, opt.number("messages", 150000))),
                        static_cast<std::size_t>(std::max(1LL, opt.number("window", 64))));
+  for (bool wait : {false, true})
+    if (up && scenarios.find(wait ? ",wait," : ",idle,") != std::string::npos)
+      up = scenarioIdle(env, static_cast<std::size_t>(std::max(1LL, opt.number("sessions", 10000))),
+                        static_cast<std::size_t>(std::max(1LL, opt.number("per-client", 50))),
+                        static_cast<std::size_t>(std::max(1LL, opt.number("parallel", 8))), wait);
   if (!up) std::printf("the daemon (pid %d) is gone\n", static_cast<int>(env.pid));
   return up ? 0 : 1;
 }

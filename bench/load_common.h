@@ -6,6 +6,7 @@
 #include <systemd/sd-bus.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
@@ -126,6 +127,18 @@ inline std::optional<double> cpuSeconds(pid_t pid) { return cpuSecondsOf("/proc/
 inline std::optional<double> threadCpuSeconds(pid_t tid) {
   return cpuSecondsOf("/proc/self/task/" + std::to_string(tid) + "/stat");
 }
+
+// A numeric field of /proc/<pid>/status ("VmRSS", "Threads"); pid 0 is this process.
+// -1 when it cannot be read (the process is gone).
+inline double procStatus(pid_t pid, const char* field) {
+  std::ifstream in(pid ? "/proc/" + std::to_string(pid) + "/status" : std::string("/proc/self/status"));
+  const std::string prefix = std::string(field) + ":";
+  for (std::string line; std::getline(in, line);)
+    if (line.rfind(prefix, 0) == 0) return std::atof(line.c_str() + prefix.size());
+  return -1;
+}
+// VmRSS in MiB; 0 when it cannot be read.
+inline double rssMiB(pid_t pid) { return std::max(0.0, procStatus(pid, "VmRSS") / 1024.0); }
 
 // The payload of the message loads: 20 entries (7 strings, 7 64-bit integers, 6 doubles).
 inline Dictionary makePayload() {

@@ -6,7 +6,8 @@
 #
 # Environment: REPETITIONS (3), SECONDS_PER_PHASE of pinging (10), HOSTILE connections
 # (4), CLIENTS that vanish (12000), PARALLEL (8), MESSAGES into one session (150000),
-# WINDOW (64), SCENARIOS (ping,vanish,flood), JOBS build jobs (2), VIREO_BENCH_BUILD
+# WINDOW (64), SESSIONS left idle (10000), PER_CLIENT sessions (50), SCENARIOS
+# (ping,vanish,flood,idle,wait), JOBS build jobs (2), VIREO_BENCH_BUILD
 # build directory (build/bench), VIREO_BENCH_NO_BUILD=1 to skip the build,
 # VIREO_BENCH_KEEP=1 to keep the temporary directory (daemon log, store).
 set -eu
@@ -16,10 +17,11 @@ TARGETS="hostile_load" TMP_PREFIX=vireo-hostile
 
 status=0
 "$BUILD/bench/hostile_load" --pid "$DAEMON_PID" --db "$STATE_DIRECTORY/vireo.db" \
-  --repetitions "${REPETITIONS:-3}" --scenarios "${SCENARIOS:-ping,vanish,flood}" \
+  --repetitions "${REPETITIONS:-3}" --scenarios "${SCENARIOS:-ping,vanish,flood,idle,wait}" \
   --seconds "${SECONDS_PER_PHASE:-10}" --hostile "${HOSTILE:-4}" \
   --clients "${CLIENTS:-12000}" --parallel "${PARALLEL:-8}" \
-  --messages "${MESSAGES:-150000}" --window "${WINDOW:-64}" || status=$?
+  --messages "${MESSAGES:-150000}" --window "${WINDOW:-64}" \
+  --sessions "${SESSIONS:-10000}" --per-client "${PER_CLIENT:-50}" || status=$?
 
 echo "== the daemon after the run"
 if kill -0 "$DAEMON_PID" 2>/dev/null; then

@@ -52,8 +52,6 @@ class ExitProcessControl final : public ProcessControl {
     if (beforeExit_) beforeExit_();
     _exit(status);
   }
-  // glibc keeps freed heap; a session's kept payloads can be megabytes of it.
-  void releaseFreeMemory() override { malloc_trim(0); }
 
  private:
   const std::function<void()> beforeExit_;
@@ -118,6 +116,10 @@ int main(int argc, char** argv) {
 
   // Before any thread exists, so that only the bus loop receives them.
   daemon::blockServiceSignals();
+  // One heap for every thread: per-thread arenas keep megabytes of fragments after a
+  // burst that malloc_trim cannot hand back, and each thread's cache covers most of
+  // the contention a shared heap would add.
+  mallopt(M_ARENA_MAX, 1);
 
   auto logger = linux_platform::LinuxLogger::fromEnvironment();
   const auto directories = linux_platform::ServiceDirectories::fromEnvironment();

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "base/mutex.h"
+#include "base/ring.h"
 
 namespace vireo {
 
@@ -64,6 +65,8 @@ class ThreadPoolDispatcher::Core {
   void submitDelayed(std::chrono::nanoseconds delay, Task task);
   // Puts a park's deadline on the timer. False once the timer has stopped.
   bool armDeadline(std::chrono::nanoseconds timeout, std::shared_ptr<PoolParking> parking);
+  // A park ended before its deadline; its entry now holds a spent park.
+  void parkEndedEarly();
 
  private:
   // A serial queue with work, or a lone closure of the concurrent queue.
@@ -72,8 +75,10 @@ class ThreadPoolDispatcher::Core {
     Task task;
   };
 
-  // A delayed closure, or the deadline of a park (whose entry stays until due even
-  // when the park ends earlier: it then only holds the spent park).
+  // A delayed closure, or the deadline of a park. A park that ends earlier leaves
+  // its entry holding the spent park until the spent entries are half the heap, then
+  // they all go at once: thousands of sessions that waited a moment for their backends
+  // must not keep their parks (and the heap pages around them) for the whole interval.
   struct Delayed {
     SteadyTime due;
     std::uint64_t sequence;
@@ -110,6 +115,7 @@ class ThreadPoolDispatcher::Core {
   std::condition_variable timerCv_;
   std::vector<Delayed> delayed_ VIREO_GUARDED_BY(timerMu_);
   std::uint64_t sequence_ VIREO_GUARDED_BY(timerMu_) = 0;
+  std::size_t spentParks_ VIREO_GUARDED_BY(timerMu_) = 0;  // about; reset when swept
   std::thread timer_ VIREO_GUARDED_BY(timerMu_);
   bool timerStop_ VIREO_GUARDED_BY(timerMu_) = false;
 };
@@ -128,6 +134,10 @@ class PoolParking final : public Parking {
   void expire() { end(nullptr, true); }
   // Shutdown: the queue's waiting closures are released unrun.
   void drop();
+  bool spent() {
+    MutexLock lock(mu_);
+    return !queue_;
+  }
 
  private:
   bool end(Task next, bool timedOut);
@@ -183,6 +193,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
 
   const std::string& label() const override { return label_; }
   QoS qos() const { return qos_; }
+  ThreadPoolDispatcher::Core& core() const { return *core_; }
 
   std::shared_ptr<Parking> park(std::chrono::nanoseconds timeout, Task onTimeout) override {
     if (core_->stopping()) return std::make_shared<PoolParking>();
@@ -251,7 +262,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
   // Shutdown: a parked queue lets go of its park and of what waits behind it.
   void dropParked(const PoolParking* which) {
     std::shared_ptr<Parking> ended;
-    std::deque<Task> dropped;
+    Ring<Task> dropped;
     {
       MutexLock lock(mu_);
       if (park_.get() == which) ended = std::move(park_);
@@ -264,7 +275,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
 
   // After shutdown: drops what is queued.
   void clear() {
-    std::deque<Task> dropped;
+    Ring<Task> dropped;
     {
       MutexLock lock(mu_);
       dropped.swap(fifo_);
@@ -280,7 +291,7 @@ class PoolQueue final : public SerialQueue, public std::enable_shared_from_this<
   const std::string label_;
   const QoS qos_;
   Mutex mu_;  // guards fifo_, scheduled_ and park_
-  std::deque<Task> fifo_ VIREO_GUARDED_BY(mu_);
+  Ring<Task> fifo_ VIREO_GUARDED_BY(mu_);
   bool scheduled_ VIREO_GUARDED_BY(mu_) = false;
   std::shared_ptr<PoolParking> park_ VIREO_GUARDED_BY(mu_);  // pending park; the queue runs nothing while set
 };
@@ -295,6 +306,7 @@ bool PoolParking::end(Task next, bool timedOut) {
     onTimeout_ = nullptr;
   }
   if (!queue) return false;  // next is released unrun
+  if (!timedOut) queue->core().parkEndedEarly();
   queue->unpark(this, timedOut ? std::move(onTimeout) : std::move(next));
   return true;
 }
@@ -480,6 +492,15 @@ bool ThreadPoolDispatcher::Core::armDeadline(std::chrono::nanoseconds timeout, s
   // Without a timer thread no deadline could ever pass: it passes now.
   if (noTimer) parking->expire();
   return true;
+}
+
+void ThreadPoolDispatcher::Core::parkEndedEarly() {
+  constexpr std::size_t kSweepAtLeast = 64;
+  MutexLock lock(timerMu_);
+  if (++spentParks_ < kSweepAtLeast || spentParks_ * 2 < delayed_.size()) return;
+  std::erase_if(delayed_, [](const Delayed& d) { return d.parking && d.parking->spent(); });
+  std::make_heap(delayed_.begin(), delayed_.end(), laterThan);
+  spentParks_ = 0;
 }
 
 void ThreadPoolDispatcher::Core::timerMain() {

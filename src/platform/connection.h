@@ -37,8 +37,6 @@ class ProcessControl {
  public:
   virtual ~ProcessControl() = default;
   [[noreturn]] virtual void exitProcess(int status) = 0;
-  // Hands memory the process has freed back to the system, after a large release.
-  virtual void releaseFreeMemory() {}
 };
 
 }  // namespace vireo

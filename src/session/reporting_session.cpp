@@ -20,8 +20,6 @@ constexpr std::int64_t kClientType = 19;
 constexpr double kClientVersion = 2.0;
 // Kept payload bytes past which a stop hands freed memory back to the system, once
 // the store has had a moment to write what the session sent last.
-constexpr std::size_t kReleaseMemoryAfterBytes = 256 << 10;
-constexpr std::chrono::milliseconds kReleaseMemoryDelay{250};
 
 }  // namespace
 
@@ -137,19 +135,13 @@ void VRReportingSession::stop() {
     });
   });
 
-  std::size_t released = 0;
   if (auto payloads = aggregatedPayloadData()) {
     // Taken so that no append is half-way while the array is let go.
     MutexLock arrayGuard(payloads->lock);
     MutexLock guard(fieldsLock_);
-    released = payloads->keptBytes;
     aggregatedPayloadData_.reset();
   }
   started_ = false;
-  // A large summary leaves free memory behind; once it is gone, give it back.
-  if (released >= kReleaseMemoryAfterBytes)
-    env_->platform.dispatcher.asyncLowPriority(kReleaseMemoryDelay,
-                                               [env = env_] { env->platform.process.releaseFreeMemory(); });
 
   // Every started session was given a callback by its server instance; a missing one
   // must still not bring the daemon down.

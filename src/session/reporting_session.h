@@ -9,13 +9,13 @@
 
 #include <atomic>
 #include <cstdint>
-#include <deque>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
 #include "base/mutex.h"
+#include "base/ring.h"
 #include "base/value.h"
 #include "base/value_pack.h"
 #include "dispatch/dispatch.h"
@@ -36,7 +36,7 @@ class ReportingEnvironment;
 // at about their JSON size, and unpacked once, for the summary.
 struct AggregatedPayloads {
   Mutex lock;
-  std::deque<std::string> entries VIREO_GUARDED_BY(lock);  // packed
+  Ring<std::string> entries VIREO_GUARDED_BY(lock);  // packed
   std::size_t keptBytes VIREO_GUARDED_BY(lock) = 0;
   std::uint64_t dropped VIREO_GUARDED_BY(lock) = 0;  // entries let go for the budget
 

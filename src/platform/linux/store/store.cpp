@@ -1,5 +1,6 @@
 #include "platform/linux/store/store.h"
 
+#include <malloc.h>
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -426,9 +427,29 @@ void LocalStore::writerLoop() {
   std::string badError;        // why the first of the batch's bad rows was refused
   std::uint64_t failures = 0;  // consecutive failed attempts
   std::chrono::milliseconds delay{0};
+  bool cacheHeld = false;  // pages cached since the last release
   MutexLock lock(mutex_);
   for (;;) {
     if (failures == 0) {
+      // A writer that has gone quiet gives its page cache back: the rows it wrote
+      // are in the file, and a burst of sends should not cost memory for ever.
+      if (cacheHeld) {
+        const auto quietUntil = std::chrono::steady_clock::now() + options_.releaseCacheAfter;
+        while (!stopping_ && queue_.empty() && lock.waitUntil(wake_, quietUntil) == std::cv_status::no_timeout) {
+        }
+      }
+      if (cacheHeld && !stopping_ && queue_.empty()) {
+        // So are the row vectors, which keep the capacity of the largest burst.
+        std::vector<Row>().swap(queue_);
+        std::vector<Row>().swap(batch);
+        lock.unlock();
+        sqlite3_db_release_memory(db_);
+        // glibc keeps what is freed. Quiet store, quiet daemon: the payloads a stopped
+        // session kept for its summary and the cache just let go go back to the system.
+        malloc_trim(0);
+        lock.lock();
+        cacheHeld = false;
+      }
       while (!stopping_ && queue_.empty()) lock.wait(wake_);
       const auto until = queuedSince_ + options_.groupWindow;
       while (!stopping_ && queue_.size() < options_.groupRows &&
@@ -453,6 +474,7 @@ void LocalStore::writerLoop() {
 
     std::string error;
     const bool ok = writeBatch(batch, &error, &badError);
+    cacheHeld = true;
     if (ok) {
       if (const auto bad = std::ranges::count(batch, true, &Row::bad); bad > 0) {
         VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::writerLoop",

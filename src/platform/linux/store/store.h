@@ -61,6 +61,8 @@ class LocalStore {
     // trickle of rows costs a commit every few milliseconds rather than one per row.
     std::chrono::microseconds groupWindow{2000};
     std::size_t groupRows = 256;
+    // After this long without rows the writer hands SQLite's page cache back.
+    std::chrono::milliseconds releaseCacheAfter{500};
   };
 
   // Opens (creating it and its directory) STATE/vireo.db. A store that cannot be
