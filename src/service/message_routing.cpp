@@ -59,12 +59,14 @@ void VRReportingServerInstance::doSendMessage(const Dictionary& payload, std::ui
     if (reply) reply(Error{kReportingErrorDomain, kReportingDisabledCode, "reporting is disabled"});
     return;
   }
+  // Nothing below can fail the call, so the answer leaves first: the client's next
+  // call crosses the bus while this one is routed.
+  if (reply) reply(std::nullopt);
   if (reporterIDs) {
     sendAddressed(payload, category, type, *reporterIDs);
   } else {
     sendBroadcast(payload, category, type, delegate.get());
   }
-  if (reply) reply(std::nullopt);
 }
 
 void VRReportingServerInstance::sendAddressed(const Dictionary& payload, std::uint32_t category, std::uint16_t type,
