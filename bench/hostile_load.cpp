@@ -24,6 +24,7 @@
 #include <thread>
 #include <vector>
 
+#include "base/value_pack.h"
 #include "load_common.h"
 #include "platform/linux/paths.h"
 #include "vireo/client.h"
@@ -496,8 +497,15 @@ bool scenarioFlood(const Env& env, std::size_t messages, std::size_t window) {
       "   %zu in flight, then stopped. RSS (MiB, sampled every 10 ms) before the session, peak while\n"
       "   sending, right after the stop answer, peak and last within 1 s after it; 'back' is when RSS\n"
       "   first came within 10%% of before (target: within 1 s). growth/msg = (peak while\n"
-      "   sending - before) / accepted. stored: the session's type-1 rows in telemetry_messages.\n\n",
+      "   sending - before) / accepted. stored: the session's type-1 rows in telemetry_messages.\n",
       messages, jsonBytes, window);
+  // What a session keeps of each message for its summary (up to MaxKeptBytesPerSession):
+  // the payload under its message identifier, packed as the daemon packs it.
+  const Value kept(Dictionary{{Value("audio_stream_begin_1"), Value(payload)}});
+  const std::size_t keptBytes = packedFootprint(packValue(kept));
+  const std::size_t keptJson = toJson(kept, JsonMode::Lenient).value_or("").size();
+  std::printf("   Kept for the summary: %zu bytes a message against %zu of compact JSON (%.2fx, target <= 1.5x).\n\n",
+              keptBytes, keptJson, static_cast<double>(keptBytes) / static_cast<double>(keptJson));
   std::printf("  %-4s %8s %6s %7s %6s %6s %7s %6s %6s %7s %8s %7s %8s\n", "rep", "accepted", "failed", "msgs/s",
               "before", "peak", "stopped", "peak1s", "+1 s", "back ms", "growth/m", "target", "stored");
   std::vector<double> rate, before, peak, stopped, peakAfter, later, perMsg;
