@@ -1,7 +1,6 @@
 #include "ctl/store_query.h"
 
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 
 #include <nlohmann/json.hpp>
 
@@ -9,35 +8,36 @@
 #include <cstdlib>
 #include <tuple>
 
+#include "fakes/fake_platform.h"
 #include "fakes/temp_dir.h"
+#include "platform/linux/store/store.h"
+#include "platform/linux/system_clock.h"
 
 namespace vireo::ctl {
 namespace {
 
 class StoreQueryTest : public ::testing::Test {
  protected:
+  // Rows written by the daemon's own store, so the queries run against its schema.
   void SetUp() override {
-    sqlite3* db = nullptr;
-    ASSERT_EQ(sqlite3_open(db_.c_str(), &db), SQLITE_OK);
-    const char* sql = R"(
-      CREATE TABLE telemetry_sessions (id INTEGER PRIMARY KEY, session_info TEXT NOT NULL, user_info TEXT NOT NULL,
-        backends TEXT, created_at REAL NOT NULL, flushed_at REAL);
-      CREATE TABLE telemetry_messages (id INTEGER PRIMARY KEY, session INTEGER REFERENCES telemetry_sessions(id),
-        session_info TEXT, user_info TEXT, category INTEGER NOT NULL, type INTEGER NOT NULL, payload TEXT NOT NULL,
-        sent_at REAL NOT NULL);
-      CREATE TABLE analytics_events (id INTEGER PRIMARY KEY, name TEXT NOT NULL, payload TEXT NOT NULL, at REAL NOT NULL);
-      CREATE TABLE energy_events (id INTEGER PRIMARY KEY, client INTEGER NOT NULL, name TEXT NOT NULL,
-        payload TEXT NOT NULL, at REAL NOT NULL);
-      INSERT INTO telemetry_sessions VALUES (1, '{"client_type":"x"}', '{"client_name":"vireo","service_name":"media"}',
-        '["local"]', 100, NULL), (2, '{}', '{"client_name":"vireo","service_name":"telephony"}', NULL, 200, 210);
-      INSERT INTO telemetry_messages VALUES (1, 1, NULL, NULL, 3, 4, '{"a_b":1}', 101), (2, 2, NULL, NULL, 9, 0,
-        '{"k":2}', 201), (3, NULL, '{}', '{"service_name":"standalone"}', 8, 4, '{"k":3}', 300);
-      INSERT INTO analytics_events VALUES (1, 'com.orvane.vireo.Session_Generic.Start', '{"x":1}', 150),
-        (2, 'com.orvane.vireo.vrreportingclientuptime', '{"seconds":2.5}', 250);
-      INSERT INTO energy_events VALUES (1, 7, 'Lumen_Haptics', '{"EngineOnDuration":3}', 160);
-    )";
-    ASSERT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK);
-    sqlite3_close(db);
+    testing::RecordingLogger logger;
+    linux_platform::SystemClock clock;
+    linux_platform::LocalStore store(dir_, logger, clock);
+    auto media = store.insertTelemetrySession(Dictionary{{"client_type", "x"}},
+                                              Dictionary{{"client_name", "vireo"}, {"service_name", "media"}}, 100);
+    auto phone = store.insertTelemetrySession(Dictionary{},
+                                              Dictionary{{"client_name", "vireo"}, {"service_name", "telephony"}}, 200);
+    ASSERT_TRUE(media && phone);
+    store.setBackends(*media, std::vector<std::string>{"local"});
+    store.setFlushed(*phone, 210);
+    store.insertTelemetryMessage(media, nullptr, nullptr, 3, 4, Dictionary{{"a_b", 1}}, 101);
+    store.insertTelemetryMessage(phone, nullptr, nullptr, 9, 0, Dictionary{{"k", 2}}, 201);
+    const Dictionary none, standalone{{"service_name", "standalone"}};
+    store.insertTelemetryMessage(std::nullopt, &none, &standalone, 8, 4, Dictionary{{"k", 3}}, 300);
+    store.insertAnalyticsEvent("com.orvane.vireo.Session_Generic.Start", Dictionary{{"x", 1}}, 150);
+    store.insertAnalyticsEvent("com.orvane.vireo.vrreportingclientuptime", Dictionary{{"seconds", 2.5}}, 250);
+    store.insertEnergyEvent(7, "Lumen_Haptics", Dictionary{{"EngineOnDuration", 3}}, 160);
+    ASSERT_TRUE(store.flush(std::chrono::seconds(10)));
   }
 
   // Runs a query and returns its standard output.

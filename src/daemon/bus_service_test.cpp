@@ -26,13 +26,6 @@ struct Refuse : ListenerDelegate {
   bool shouldAcceptNewConnection(ClientConnection&) override { return false; }
 };
 
-// A client of the private bus, which the suite made the session bus.
-dbus::BusRef connectClient() {
-  dbus::BusRef bus;
-  EXPECT_GE(sd_bus_open_user(bus.out()), 0);
-  return bus;
-}
-
 // A private dbus-daemon for the whole suite and a started service on it per test.
 class BusServiceTest : public ::testing::Test {
  protected:
@@ -66,7 +59,7 @@ class BusServiceTest : public ::testing::Test {
     options.address = address_;
     ASSERT_EQ(service_.open(options), 0);
     service_.start();
-    client_ = connectClient();
+    ASSERT_GE(sd_bus_open_user(client_.out()), 0);  // the private bus, which the suite made the session bus
   }
   void TearDown() override {
     client_.reset();

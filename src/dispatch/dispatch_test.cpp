@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "dispatch/thread_pool.h"
+#include "fakes/fake_platform.h"
 
 namespace vireo {
 namespace {
@@ -40,18 +41,7 @@ struct Countdown {
 };
 
 // What ran, in order, across threads.
-struct Trail {
-  void add(std::string step) {
-    std::lock_guard lock(mu);
-    steps.push_back(std::move(step));
-  }
-  std::vector<std::string> operator()() {
-    std::lock_guard lock(mu);
-    return steps;
-  }
-  std::mutex mu;  // guards steps
-  std::vector<std::string> steps;
-};
+using Trail = testing::Recorder<std::string>;
 
 // Many producers feed many queues; every closure checks that it is alone on its
 // queue and that each producer's sequence numbers arrive in order.

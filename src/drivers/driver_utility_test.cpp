@@ -106,12 +106,8 @@ TEST(DriverUtility, SnapshotAndPositiveDeltaUnderFlattenedKeys) {
   VRReportingDriverUtility utility(library, logger);
   ASSERT_EQ(utility.ioChannelSubscriptions().size(), 4u);
 
+  // Nothing grew yet. (Every group's keys show up in the deltas below.)
   auto snapshot = utility.getSnapShot();
-  std::vector<std::string> keys;
-  for (const auto& [key, set] : snapshot->samples) keys.push_back(key);
-  EXPECT_THAT(keys, ElementsAre("OrvaneTK4HB-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"));
-
-  // Nothing grew yet.
   EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(snapshot.get()), std::nullopt);
 
   orvane = {{"overruns", 2}, {"rx", 15}};

@@ -101,22 +101,5 @@ TEST_F(RoutingTest, BroadcastReachesStartedSessionsOfEveryClientSessionFirst) {
   EXPECT_TRUE(h.fake.telemetry.oneShots().empty());
 }
 
-TEST_F(RoutingTest, DisabledReportingRefusesBeforeAnySessionOrSinkSeesTheMessage) {
-  h.fake.defaults.set("disable_reporting", "yes");
-  h.postDefaults();
-  for (const auto& ids : {std::optional<std::vector<std::int64_t>>{}, std::optional{std::vector<std::int64_t>{1}}}) {
-    auto error = send(ids, Dictionary{{"EngineOnTime", 1.0}});
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain, "com.orvane.audio.reporting");
-    EXPECT_EQ(error->code, 1);
-  }
-  h.fake.dispatcher.runLowPriority();
-  EXPECT_TRUE(calls.empty());
-  EXPECT_TRUE(h.fake.telemetry.oneShots().empty());
-  EXPECT_EQ(payloads(1), 0);
-  EXPECT_FALSE(h.fake.logger.contains("active reporting sessions"));
-  EXPECT_EQ(h.fake.tracer.count(trace::kServerSend), 2u);
-}
-
 }  // namespace
 }  // namespace vireo

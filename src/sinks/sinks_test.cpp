@@ -2,7 +2,6 @@
 
 #include "fakes/fake_platform.h"
 #include "session/reporting_session.h"
-#include "sinks/tallyhub_bridge.h"
 #include "sinks/voltmark_utility.h"
 
 namespace vireo {
@@ -20,33 +19,7 @@ class SinksTest : public ::testing::Test {
   FakePlatform p;
 };
 
-TEST_F(SinksTest, AnalyticsEventNameAndPayload) {
-  Dictionary info{{"HostApplicationDisplayID", "com.example.player"}};
-  auto s = session(&info);
-  Dictionary message{{"route", "speaker"}, {"HostApplicationDisplayID", "spoofed"}, {"_throttle_seconds", 2}};
-  VRReportingTallyhubBridge::handleEvent(p.env, &message, 0x40000003, 1, *s);
-  VRReportingTallyhubBridge::handleEvent(p.env, &message, 8, 4, *s);
-  VRReportingTallyhubBridge::handleEvent(p.env, nullptr, 0, 0, *session());
-
-  auto events = p.analytics.events();
-  ASSERT_EQ(events.size(), 3u);
-  EXPECT_EQ(events[0].name, "com.orvane.vireo.Routing_Playback.Start");
-  EXPECT_EQ(events[0].payload, (Dictionary{{"route", "speaker"},
-                                           {"HostApplicationDisplayID", "com.example.player"},
-                                           {"_throttle_seconds", 2}}));
-  EXPECT_EQ(events[1].name, "com.orvane.vireo.Error.Error");
-  EXPECT_EQ(events[2].name, "com.orvane.vireo.Undefined.Generic");
-  EXPECT_EQ(events[2].payload, (Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
-  // The caller's message is untouched.
-  EXPECT_EQ(message.find("HostApplicationDisplayID")->text(), "spoofed");
-
-  // An event nobody wants is not built.
-  p.analytics.unwanted.set({"com.orvane.vireo.Playback.Start"});
-  VRReportingTallyhubBridge::handleEvent(p.env, &message, 3, 1, *s);
-  EXPECT_EQ(p.analytics.events().size(), 3u);
-  EXPECT_EQ(p.analytics.skipped(), std::vector<std::string>{"com.orvane.vireo.Playback.Start"});
-}
-
+// The analytics event's name and payload are checked end to end (store suite).
 TEST_F(SinksTest, EnergyLogOnlyForEngineOnReports) {
   Dictionary info{{"HostApplicationDisplayID", "com.example.game"}};
   auto s = session(&info);

@@ -28,25 +28,13 @@ TEST(VocabularyLabels, UnrecognisedAndOutOfRangeCodes) {
   EXPECT_EQ(serviceNameOrUnknown(12), "unknown");
 }
 
-TEST(VocabularyLabels, InternalBuildIsComputedOnce) {
-  FakePlatform p;
-  p.device.internalBuild.set(true);
-  EXPECT_TRUE(VRReportingIsInternalBuild(*p.env));
-  p.device.internalBuild.set(false);
-  EXPECT_TRUE(VRReportingIsInternalBuild(*p.env));
-
-  FakePlatform unanswered;
-  EXPECT_FALSE(VRReportingIsInternalBuild(*unanswered.env));
-}
-
 // The bounded wait on a queue run by hand, with manual time for its deadlines.
 class BoundedWait : public ::testing::Test {
  protected:
   // Starts a wait from a closure on the queue, with another closure queued behind it.
-  void start(std::shared_ptr<ReportingCondition> condition, double interval,
-             std::optional<LogScope> scope = LogScope::Session) {
-    queue->async([this, condition, interval, scope] {
-      VRReportingUtilityWaitAsync(queue, condition, "waiting", "gave up", p.logger, scope, interval,
+  void start(std::shared_ptr<ReportingCondition> condition, double interval) {
+    queue->async([this, condition, interval] {
+      VRReportingUtilityWaitAsync(queue, condition, "waiting", "gave up", p.logger, LogScope::Session, interval,
                                   [this](bool done) { events.push_back(done ? "done" : "failed"); });
     });
     queue->async([this] { events.push_back("behind"); });
@@ -56,9 +44,6 @@ class BoundedWait : public ::testing::Test {
     std::vector<std::string> out;
     for (auto& e : p.logger.entries()) out.push_back(e.message);
     return out;
-  }
-  static std::chrono::nanoseconds seconds(double s) {
-    return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::duration<double>(s));
   }
 
   FakePlatform p;
@@ -79,35 +64,14 @@ TEST_F(BoundedWait, SetFlagEndsAtOnceAndALateSignalDoesNot) {
   start(late, 9.0);
   EXPECT_EQ(p.dispatcher.parkedCount(), 1u);  // the queue waits, the closure behind too
   EXPECT_TRUE(events.empty());
-  p.dispatcher.advance(seconds(9.0));
+  p.dispatcher.advance(9s);
   late->signalDone();
+  late->signalDone();  // the second finds the wait already over
   p.dispatcher.runAll();
   EXPECT_EQ(lines(), (std::vector<std::string>{"waiting", "gave up"}));
   EXPECT_EQ(p.logger.entries()[1].scope, LogScope::Session);
   EXPECT_EQ(events, (std::vector<std::string>{"failed", "behind"}));
   EXPECT_TRUE(late->done());
-}
-
-TEST_F(BoundedWait, EachSignalRestartsTheIntervalUntilTheFlagIsSet) {
-  auto condition = std::make_shared<ReportingCondition>();
-  condition->signal();  // nobody waits yet: lost
-  start(condition, 9.0, std::nullopt);
-  p.dispatcher.advance(seconds(6));
-  condition->signal();
-  p.dispatcher.runAll();
-  EXPECT_EQ(lines(), (std::vector<std::string>{"waiting", "continuing", "waiting"}));
-  EXPECT_EQ(p.dispatcher.advance(seconds(6)), 0u);  // 12 s since the start, 6 since the signal
-  condition->signalDone();
-  condition->signalDone();  // the second finds the wait already woken
-  p.dispatcher.runAll();
-  EXPECT_EQ(lines(), (std::vector<std::string>{"waiting", "continuing", "waiting", "continuing"}));
-  EXPECT_EQ(events, (std::vector<std::string>{"done", "behind"}));
-  for (auto& e : p.logger.entries()) EXPECT_EQ(e.scope, LogScope::DefaultLog);
-  // Over: neither signals nor the old deadlines do anything more.
-  condition->signal();
-  EXPECT_EQ(p.dispatcher.advance(std::chrono::hours(1)), 0u);
-  p.dispatcher.runAll();
-  EXPECT_EQ(p.logger.size(), 4u);
 }
 
 // On the real pool, signals from another thread and deadlines race the queues.

@@ -92,11 +92,7 @@ struct FakeClock : Clock {
 
 // Answers next once (reduced below the bound), then 0.
 struct FakeRandom : RandomSource {
-  std::uint32_t uniformBelow(std::uint32_t bound) override {
-    boundsAsked.add(bound);
-    return bound == 0 ? 0 : next.exchange(0) % bound;
-  }
-  Recorder<std::uint32_t> boundsAsked;
+  std::uint32_t uniformBelow(std::uint32_t bound) override { return bound == 0 ? 0 : next.exchange(0) % bound; }
   std::atomic<std::uint32_t> next{0};
 };
 
@@ -218,7 +214,6 @@ class ManualDispatcher : public Dispatcher {
     return n;
   }
   void runUntilIdle() { do runAll(); while (runLowPriority() != 0); }
-  std::size_t pendingLowPriority() const { return lowPriority_.with([](auto& l) { return l.size(); }); }
   Recorder<std::chrono::nanoseconds> lowPriorityDelays;
 
   // Moves the manual time on; parks whose deadline has passed time out (their timeout
@@ -359,13 +354,10 @@ struct AnalyticsEvent { std::string name; Dictionary payload; };
 struct FakeAnalyticsService : AnalyticsService {
   void sendEventLazy(std::string_view name, const std::function<Dictionary()>& payload) override {
     if (onCall) onCall();
-    if (unwanted.with([&](auto& u) { return u.count(std::string(name)) != 0; })) return skipped.add(std::string(name));
     events.add({std::string(name), payload ? payload() : Dictionary{}});  // built outside the lock
   }
   std::function<void()> onCall;  // runs first in every call; set before any thread runs
   Recorder<AnalyticsEvent> events;
-  Recorder<std::string> skipped;
-  Locked<std::set<std::string>> unwanted;  // events of these names are not wanted: no payload is built
 };
 
 struct EnergyEvent { int client = 0; std::string name; Dictionary event; };
@@ -442,9 +434,8 @@ struct FakeProcessTable : ProcessTable {
 // In-memory files under a fixed log directory.
 struct FakeDiagnosticFiles : DiagnosticFiles {
   std::string logDirectory() const override { return "/fake/logs"; }
-  bool createDirectory(const std::string& path, unsigned, Error* error) override {
+  bool createDirectory(const std::string&, unsigned, Error* error) override {
     if (auto failure = createDirectoryError()) return *error = *failure, false;
-    directories.with([&](auto& d) { d.insert(path); });
     return true;
   }
   bool writeAtomically(const std::string& path, std::string_view text, Error*) override {
@@ -452,30 +443,22 @@ struct FakeDiagnosticFiles : DiagnosticFiles {
     return true;
   }
   Locked<std::map<std::string, std::string>> files;
-  Locked<std::set<std::string>> directories;
   Locked<std::optional<Error>> createDirectoryError;
 };
 
 // No driver has statistics (the driver utility has its own tests over a scripted library).
 struct FakeDriverStats : DriverStatsLibrary {
+  using StatsError = std::optional<DriverStatsError>*;
   std::unique_ptr<DriverChannelSet> copyChannelsInGroup(const std::optional<std::string>&,
                                                         const std::optional<std::string>&, std::uint64_t,
-                                                        std::optional<DriverStatsError>*) override {
-    return nullptr;
-  }
+                                                        StatsError) override { return nullptr; }
   std::int32_t channelCount(const DriverChannelSet&) override { return 0; }
   DriverSubscriptionHandle createSubscription(const DriverChannelSet&,
-                                              std::unique_ptr<DriverSubscribedChannels>*) override {
-    return nullptr;
-  }
+                                              std::unique_ptr<DriverSubscribedChannels>*) override { return nullptr; }
   std::unique_ptr<DriverSampleSet> createSamples(DriverSubscriptionHandle, const DriverSubscribedChannels&,
-                                                 std::optional<DriverStatsError>*) override {
-    return nullptr;
-  }
+                                                 StatsError) override { return nullptr; }
   std::unique_ptr<DriverSampleSet> createSamplesDelta(const DriverSampleSet*, const DriverSampleSet&,
-                                                      std::optional<DriverStatsError>*) override {
-    return nullptr;
-  }
+                                                      StatsError) override { return nullptr; }
   void iterate(const DriverSampleSet&, const std::function<DriverIterate(const DriverChannel&)>&) override {}
   std::optional<std::string> channelName(const DriverChannel&) override { return std::nullopt; }
   std::int64_t simpleIntegerValue(const DriverChannel&) override { return 0; }

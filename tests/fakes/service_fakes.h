@@ -1,5 +1,5 @@
-// A client connection the test ends by hand, and a harness for the service host and
-// server instance tests.
+// A client connection the test ends by hand (D-Bus has no interruption: only invalidation),
+// and a harness for the service host and server instance tests.
 #pragma once
 
 #include <cstdint>
@@ -25,7 +25,7 @@ class FakeConnection : public ClientConnection {
   std::int32_t processIdentifier() const override { return pid_; }
   std::string description() const override { return description_; }
   void setExportedObject(std::shared_ptr<VRReportingServiceProtocol> object) override { exported_ = std::move(object); }
-  void setInterruptionHandler(std::function<void()> handler) override { interruption_ = std::move(handler); }
+  void setInterruptionHandler(std::function<void()>) override {}
   void setInvalidationHandler(std::function<void()> handler) override { invalidation_ = std::move(handler); }
   void resume() override { resumed_ = true; }
 
@@ -34,20 +34,12 @@ class FakeConnection : public ClientConnection {
     return std::dynamic_pointer_cast<VRReportingServerInstance>(exported_);
   }
   VRReportingServiceProtocol& client() const { return *exported_; }
-  void interrupt() const { interruption_(); }
   void invalidate() const { invalidation_(); }
-  // The connection service lets go of the exported object and the handlers.
-  void release() {
-    exported_.reset();
-    interruption_ = nullptr;
-    invalidation_ = nullptr;
-  }
 
  private:
   const std::int32_t pid_;
   const std::string description_;
   std::shared_ptr<VRReportingServiceProtocol> exported_;
-  std::function<void()> interruption_;
   std::function<void()> invalidation_;
   bool resumed_ = false;
 };

@@ -60,11 +60,9 @@ void checkStoreQuery(const std::vector<std::string>& words) {
   FUZZ_CHECK(!q->limit || *q->limit >= 0);
   const std::string sql = storeSql(*q);
   // Parameters are bound only when present; the SQL must not name the others.
-  FUZZ_CHECK((sql.find("?1") != std::string::npos) == q->name.has_value());
-  FUZZ_CHECK((sql.find("?2") != std::string::npos) == q->session.has_value());
-  FUZZ_CHECK((sql.find("?3") != std::string::npos) == q->since.has_value());
-  FUZZ_CHECK((sql.find("?4") != std::string::npos) == q->until.has_value());
-  FUZZ_CHECK((sql.find("?5") != std::string::npos) == q->limit.has_value());
+  const bool present[] = {q->name.has_value(), q->session.has_value(), q->since.has_value(), q->until.has_value(),
+                          q->limit.has_value()};
+  for (int i = 0; i < 5; ++i) FUZZ_CHECK((sql.find("?" + std::to_string(i + 1)) != std::string::npos) == present[i]);
 }
 
 }  // namespace

@@ -72,8 +72,10 @@ std::optional<std::int64_t> expectedCounter(const StatsTreeChannel& channel) {
   return parseStatsCounter(text);
 }
 
-std::vector<std::pair<std::string, std::int64_t>> collect(StatsTreeLibrary& library, const DriverSampleSet& set) {
-  std::vector<std::pair<std::string, std::int64_t>> out;
+using Samples = std::vector<std::pair<std::string, std::int64_t>>;
+
+Samples collect(StatsTreeLibrary& library, const DriverSampleSet& set) {
+  Samples out;
   library.iterate(set, [&](const DriverChannel& channel) {
     auto channelName = library.channelName(channel);
     FUZZ_CHECK(channelName.has_value());
@@ -83,17 +85,20 @@ std::vector<std::pair<std::string, std::int64_t>> collect(StatsTreeLibrary& libr
   return out;
 }
 
-std::vector<std::pair<std::string, std::int64_t>> expectedSamples(const std::vector<StatsTreeChannel>& channels) {
-  std::vector<std::pair<std::string, std::int64_t>> out;
-  for (const StatsTreeChannel& channel : channels)
-    if (auto value = expectedCounter(channel)) out.emplace_back(channel.name, *value);
+// What each channel's file holds, less the earlier values (a channel missing from them
+// starts at 0), saturated.
+Samples expectedSamples(const std::vector<StatsTreeChannel>& channels,
+                        const std::vector<std::optional<std::int64_t>>& earlier = {}) {
+  Samples out;
+  for (std::size_t i = 0; i < channels.size(); ++i) {
+    const std::int64_t before = i < earlier.size() ? earlier[i].value_or(0) : 0;
+    const auto later = expectedCounter(channels[i]);
+    std::int64_t d = 0;
+    if (!later) continue;
+    if (__builtin_sub_overflow(*later, before, &d)) d = before < 0 ? INT64_MAX : INT64_MIN;
+    out.emplace_back(channels[i].name, d);
+  }
   return out;
-}
-
-std::int64_t saturatedDifference(std::int64_t later, std::int64_t earlier) {
-  std::int64_t d = 0;
-  if (__builtin_sub_overflow(later, earlier, &d)) return earlier < 0 ? INT64_MAX : INT64_MIN;
-  return d;
 }
 
 void checkScan(const StatsTreeLibrary& library, const fs::path& root) {
@@ -168,14 +173,10 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   FUZZ_CHECK(none);
   for (const auto& [channelName, value] : collect(library, *none)) FUZZ_CHECK(value == 0);
 
-  // The delta pairs samples by path; a channel missing from the first sample starts at 0.
+  // The delta pairs samples by path.
   auto delta = library.createSamplesDelta(first.get(), *second, &error);
-  FUZZ_CHECK(delta);
-  std::vector<std::pair<std::string, std::int64_t>> expectedDelta;
-  for (std::size_t i = 0; i < channels.size(); ++i)
-    if (auto later = expectedCounter(channels[i]))
-      expectedDelta.emplace_back(channels[i].name, saturatedDifference(*later, before[i].value_or(0)));
-  FUZZ_CHECK(collect(library, *delta) == expectedDelta);
+  const Samples expectedDelta = expectedSamples(channels, before);
+  FUZZ_CHECK(delta && collect(library, *delta) == expectedDelta);
   if (tracing())
     for (const auto& [channelName, value] : expectedDelta)
       std::fprintf(stderr, "delta %s %lld\n", channelName.c_str(), static_cast<long long>(value));

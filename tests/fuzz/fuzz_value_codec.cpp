@@ -46,11 +46,6 @@ sd_bus* messageFactory() {
   return bus;
 }
 
-int devNull() {
-  static int fd = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
-  return fd;
-}
-
 constexpr std::string_view kBasic = "ybnqiuxtdsogh";
 
 // Length of the single complete type at the start of s.
@@ -160,7 +155,10 @@ class Generator {
       case 't': return append(m, c, in_.ConsumeIntegral<std::uint64_t>());
       // Raw bits, so NaNs, infinities and subnormals all occur.
       case 'd': return append(m, c, std::bit_cast<double>(in_.ConsumeIntegral<std::uint64_t>()));
-      case 'h': return append(m, c, devNull());
+      case 'h': {
+        static const int devNull = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+        return append(m, c, devNull);
+      }
       default: {
         // s o g: sd-bus refuses bad UTF-8, object paths and signatures without
         // touching the message, so a refused text is replaced by a valid one.

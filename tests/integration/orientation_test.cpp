@@ -21,10 +21,8 @@ class OrientationTest : public ServiceTest {
   std::map<std::string, std::string> configurationFiles() override {
     return {{"device.conf", "InternalBuild=true\nDeviceClassNumber=1\n"}};
   }
-  std::map<std::string, std::string> daemonEnvironment() override {
-    return {{"VIREO_VERBOSE", "reporting_session_verbose"}};
-  }
   void beforeDaemonStarts() override {
+    daemonEnv_["VIREO_VERBOSE"] = "reporting_session_verbose";
     fs::create_directories(dir_ + "/system");
     systemBusAddress_ = startPrivateBus(systemBus_, dir_ + "/system");
     ASSERT_FALSE(systemBusAddress_.empty());
@@ -70,16 +68,6 @@ class OrientationTest : public ServiceTest {
     ASSERT_GE(sd_bus_call_method(bus_, kProxy, kProxyPath, kMockInterface, "SetInternalProperty", nullptr, nullptr,
                                  "ssv", kProxy, "AccelerometerOrientation", "s", orientation),
               0);
-  }
-  client::StartHandle startSession(client::Client& c, std::int64_t id, std::uint16_t type, const char* app) {
-    EXPECT_EQ(*c.createReportingSession(id), true);
-    EXPECT_EQ(*c.setServiceType(type, id), true);
-    EXPECT_EQ(*c.setConfiguration(Dictionary{{"HostApplicationDisplayID", app}}, id), true);
-    return c.startReportingSessionForID(id);
-  }
-  static bool answeredTrue(const client::StartHandle& start) {
-    auto answer = start.waitFor(10s);
-    return answer && *answer && **answer;
   }
   // The summary payload of a session, once stored.
   nlohmann::json summaryOf(std::int64_t reporterID) {

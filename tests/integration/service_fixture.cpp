@@ -114,15 +114,14 @@ void ServiceTest::SetUp() {
   ASSERT_FALSE(busAddress_.empty()) << "dbus-daemon did not start";
   systemBusAddress_ = "unix:path=" + dir_ + "/no-system-bus";
   for (const auto& [name, text] : configurationFiles()) writeFile(configDir_ + "/" + name, text);
-  prepareRuntimeDirectory(runtimeDir_);
-  beforeDaemonStarts();
-  if (HasFatalFailure()) return;
-  std::map<std::string, std::string> env{
+  daemonEnv_ = {
       {"CONFIGURATION_DIRECTORY", configDir_}, {"STATE_DIRECTORY", stateDir_}, {"LOGS_DIRECTORY", logsDir_},
       {"RUNTIME_DIRECTORY", runtimeDir_}, {"VIREO_BUS", "session"}, {"DBUS_SESSION_BUS_ADDRESS", busAddress_},
-      {"DBUS_SYSTEM_BUS_ADDRESS", systemBusAddress_}, {"DBUS_STARTER_BUS_TYPE", ""}, {"JOURNAL_STREAM", ""}};
-  for (const auto& [k, v] : daemonEnvironment()) env[k] = v;
-  ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH}, env, daemonLog_));
+      {"DBUS_STARTER_BUS_TYPE", ""}, {"JOURNAL_STREAM", ""}};
+  beforeDaemonStarts();
+  if (HasFatalFailure()) return;
+  daemonEnv_["DBUS_SYSTEM_BUS_ADDRESS"] = systemBusAddress_;  // beforeDaemonStarts may start one
+  ASSERT_TRUE(daemon_.start({VIREO_DAEMON_PATH}, daemonEnv_, daemonLog_));
   auto probe = client::Client::connectAddress(busAddress_);
   ASSERT_TRUE(probe) << probe.error().message;
   bool up = eventually([&] { return bool((*probe)->ping()) || !daemon_.running(); }, 20s);
@@ -144,6 +143,21 @@ std::unique_ptr<client::Client> ServiceTest::connect() {
   if (!c) return nullptr;
   (*c)->setCallTimeout(10s);
   return std::move(*c);
+}
+
+client::StartHandle ServiceTest::startSession(client::Client& c, std::int64_t id, std::uint16_t type,
+                                              const char* app) {
+  EXPECT_EQ(*c.createReportingSession(id), true);
+  EXPECT_EQ(*c.setServiceType(type, id), true);
+  if (app) {
+    EXPECT_EQ(*c.setConfiguration(Dictionary{{"HostApplicationDisplayID", app}}, id), true);
+  }
+  return c.startReportingSessionForID(id);
+}
+
+bool ServiceTest::answeredTrue(const client::StartHandle& start) {
+  auto answer = start.waitFor(10s);
+  return answer && answer->ok() && **answer;
 }
 
 void ServiceTest::writeFile(const std::string& path, const std::string& text) {

@@ -48,15 +48,16 @@ class ServiceTest : public ::testing::Test {
 
   // Files written before the daemon starts (relative to the configuration directory).
   virtual std::map<std::string, std::string> configurationFiles() { return {}; }
-  virtual void prepareRuntimeDirectory(const std::string& /*runtime*/) {}
-  // Runs after the buses and directories exist, before the daemon starts.
+  // Runs after the buses and directories exist, before the daemon starts; may add to daemonEnv_.
   virtual void beforeDaemonStarts() {}
-  // Added to (or, when empty, removed from) the daemon's environment.
-  virtual std::map<std::string, std::string> daemonEnvironment() { return {}; }
   // Starts a dbus-daemon of its own listening in dir; returns its address.
   static std::string startPrivateBus(ChildProcess& bus, const std::string& dir);
 
   std::unique_ptr<client::Client> connect();
+  // Creates a session of the given type (and app, when given) and starts it; returns the held start.
+  static client::StartHandle startSession(client::Client& c, std::int64_t id, std::uint16_t type,
+                                          const char* app = nullptr);
+  static bool answeredTrue(const client::StartHandle& start);
   static void writeFile(const std::string& path, const std::string& text);
   static std::string readFile(const std::string& path);
   std::string log() { return readFile(daemonLog_); }
@@ -81,6 +82,8 @@ class ServiceTest : public ::testing::Test {
   // The daemon's system bus: by default an address where nothing listens.
   std::string systemBusAddress_;
   std::string configDir_, stateDir_, logsDir_, runtimeDir_;
+  // Added to (or, when empty, removed from) the daemon's environment.
+  std::map<std::string, std::string> daemonEnv_;
   ChildProcess bus_;
   ChildProcess daemon_;
   std::string daemonLog_;

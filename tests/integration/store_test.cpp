@@ -14,12 +14,6 @@ namespace fs = std::filesystem;
 
 class StoreTest : public ServiceTest {
  protected:
-  // Starts a session of the given type and returns the pending start answer.
-  client::StartHandle startSession(client::Client& c, std::int64_t id, std::uint16_t type) {
-    EXPECT_EQ(*c.createReportingSession(id), true);
-    EXPECT_EQ(*c.setServiceType(type, id), true);
-    return c.startReportingSessionForID(id);
-  }
   // Waits until the query finds at least n messages and returns them.
   std::vector<nlohmann::json> messages(const std::string& where, std::size_t n = 1) {
     std::vector<nlohmann::json> found;
@@ -52,6 +46,7 @@ TEST_F(StoreTest, MessagesSummariesEventsAndACleanExit) {
   EXPECT_EQ(found[0]["payload"]["a__b"], "x");
   EXPECT_EQ(found[0]["payload"]["ratio"], 0.5);
   ASSERT_FALSE(found[0]["session"].is_null());
+  EXPECT_TRUE(found[0]["user_info"].is_null());  // a session's message has its session's infos
   auto sessions = rows("SELECT * FROM telemetry_sessions WHERE id = " + found[0]["session"].dump());
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_EQ(sessions[0]["user_info"]["service_name"], "telephony_session");
@@ -118,6 +113,7 @@ TEST_F(StoreTest, MessagesSummariesEventsAndACleanExit) {
 TEST_F(StoreTest, ReportingSwitchFollowsTheNotificationAndSighup) {
   auto c = connect();
   ASSERT_TRUE(c);
+  auto start = startSession(*c, 1, 2);
   const std::string suite = configDir_ + "/com.orvane.vireo.conf";
   writeFile(suite, "disable_reporting = true\n");
   ASSERT_TRUE(c->postNotification(client::kReportingNotification));
@@ -128,6 +124,8 @@ TEST_F(StoreTest, ReportingSwitchFollowsTheNotificationAndSighup) {
   EXPECT_TRUE(last.error().isReportingDisabled());
   EXPECT_EQ(last.error().domain, "com.orvane.audio.reporting");
   EXPECT_EQ(last.error().code, 1);
+  // Refused, addressed or not, before any session or sink sees it (checked in the store below).
+  EXPECT_FALSE(c->sendMessage(Dictionary{{"refused", Value(1)}}, 0x40000003, 1, std::vector<std::int64_t>{1}));
 
   writeFile(suite, "# reporting back on\n");
   ASSERT_TRUE(c->postNotification(client::kReportingNotification));
@@ -136,29 +134,33 @@ TEST_F(StoreTest, ReportingSwitchFollowsTheNotificationAndSighup) {
   writeFile(suite, "disable_reporting=yes\n");
   daemon_.signal(SIGHUP);
   EXPECT_TRUE(eventually([&] { return !c->sendMessage(Dictionary{}, 3, 1).ok(); }));
+  EXPECT_FALSE(c->sendMessage(Dictionary{{"refused", Value(2)}}, 0x40000003, 1));
+  daemon_.signal(SIGTERM);  // every row committed
+  EXPECT_EQ(daemon_.waitExit(15s), 0);
+  EXPECT_EQ(count("SELECT COUNT(*) FROM telemetry_messages WHERE payload LIKE '%refused%'"), 0);
+  EXPECT_EQ(count("SELECT COUNT(*) FROM analytics_events WHERE payload LIKE '%refused%'"), 0);
+  EXPECT_GT(count("SELECT COUNT(*) FROM telemetry_messages WHERE session IS NOT NULL"), 0);  // the session was reachable
 }
 
 // An internal build with one driver reporting statistics.
 class InternalBuildTest : public StoreTest {
  protected:
   std::map<std::string, std::string> configurationFiles() override { return {{"device.conf", "InternalBuild=true\n"}}; }
-  void prepareRuntimeDirectory(const std::string& runtime) override {
-    writeFile(runtime + "/stats/Speaker/Underruns", "5\n");
-    writeFile(runtime + "/stats/Speaker/Overloads", "3\n");
+  void beforeDaemonStarts() override {
+    writeFile(runtimeDir_ + "/stats/Speaker/Underruns", "5\n");
+    writeFile(runtimeDir_ + "/stats/Speaker/Overloads", "3\n");
   }
 };
 
 TEST_F(InternalBuildTest, StopSendsTheDriverDeltaAndWritesTheSessionFile) {
   auto c = connect();
   ASSERT_TRUE(c);
-  ASSERT_EQ(*c->createReportingSession(11), true);
-  ASSERT_EQ(*c->setServiceType(2, 11), true);
-  ASSERT_EQ(*c->setConfiguration(Dictionary{{"HostApplicationDisplayID", Value("Player")}}, 11), true);
-  auto start = c->startReportingSessionForID(11);
-  ASSERT_TRUE(c->sendMessage(Dictionary{{"route", Value("speaker")}}, 0x40000003, 1, std::vector<std::int64_t>{11}));
+  auto start = startSession(*c, 11, 2, "Player");
+  ASSERT_TRUE(c->sendMessage(Dictionary{{"route", Value("speaker")}, {"HostApplicationDisplayID", Value("spoofed")}},
+                             0x40000003, 1, std::vector<std::int64_t>{11}));
   writeFile(runtimeDir_ + "/stats/Speaker/Underruns", "12\n");
   ASSERT_EQ(*c->stopReportingSessionForID(11), true);
-  ASSERT_TRUE(start.waitFor(5s));
+  ASSERT_TRUE(answeredTrue(start));
 
   // Only the positive delta goes out, as category 9.
   auto found = messages("category = 9 AND type = 0");
@@ -166,6 +168,11 @@ TEST_F(InternalBuildTest, StopSendsTheDriverDeltaAndWritesTheSessionFile) {
   EXPECT_EQ(found[0]["payload"]["Speaker_Underruns"], 7);
   EXPECT_FALSE(found[0]["payload"].contains("Speaker_Overloads"));
   EXPECT_LT(found[0]["id"], messages("type = 65535")[0]["id"]);  // ahead of the summary
+  // The analytics event names the session's application; the message itself is untouched.
+  auto events = rows("SELECT payload FROM analytics_events WHERE name = 'com.orvane.vireo.Routing_Playback.Start'");
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0]["payload"], (nlohmann::json{{"route", "speaker"}, {"HostApplicationDisplayID", "Player"}}));
+  EXPECT_EQ(messages("type = 1")[0]["payload"]["HostApplicationDisplayID"], "spoofed");
 
   fs::path dir = fs::path(logsDir_) / "Audio" / "Reporting";
   fs::path file;

@@ -16,8 +16,6 @@
 #include <utility>
 #include <vector>
 
-#include "platform/linux/defaults_store.h"
-#include "platform/linux/device_properties.h"
 #include "platform/linux/diagnostic_files.h"
 #include "platform/linux/key_file.h"
 #include "platform/linux/linux_logger.h"
@@ -153,23 +151,6 @@ TEST(ProcessTable, NamesAreShortAndValidUtf8) {
       {"a\xE2\x82", "a" + bad + bad},        // cut short
       {std::string("a\0b", 3), "a" + bad + "b"}};
   for (const auto& [in, out] : utf8) EXPECT_EQ(validUtf8(in), out);
-}
-
-// The end-to-end suite reads both kinds of file; here the answers the daemon falls back on.
-TEST(ConfigurationFiles, DeviceConfAndSuitesAreReadOnEachCall) {
-  TempDir dir;
-  DevicePropertiesFile device(dir.path());
-  SuiteFileDefaultsStore store(dir.path());
-  EXPECT_FALSE(device.boolAnswer("InternalBuild"));  // no file: the caller's default
-  EXPECT_FALSE(store.boolForKey("com.orvane.vireo", "key"));
-  dir.write("device.conf", "InternalBuild = Yes\nDeviceClassNumber=7\n");
-  EXPECT_EQ(device.intAnswer("DeviceClassNumber"), 7);
-  dir.write("device.conf", "InternalBuild=nope\nDeviceClassNumber=4294967296\n");
-  EXPECT_EQ(device.boolAnswer("InternalBuild"), false);
-  EXPECT_FALSE(device.intAnswer("DeviceClassNumber"));
-  dir.write("com.orvane.vireo.conf", "text= some words \n");
-  EXPECT_EQ(store.stringForKey("com.orvane.vireo", "text"), "some words");
-  EXPECT_FALSE(store.boolForKey("com.orvane.vireo", "text"));
 }
 
 // Summary files: replaced whole, readable by all, and a failure names its reason.
