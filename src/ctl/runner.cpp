@@ -20,7 +20,10 @@ json idsJson(const std::vector<std::int64_t>& ids) {
 std::string idsText(const std::vector<std::int64_t>& ids) {
   if (ids.empty()) return "(none)";
   std::string s;
-  for (auto id : ids) s += (s.empty() ? "" : " ") + std::to_string(id);
+  for (auto id : ids) {
+    if (!s.empty()) s += ' ';
+    s += std::to_string(id);
+  }
   return s;
 }
 
@@ -206,7 +209,8 @@ std::string formatStatus(const Dictionary& status) {
           const Dictionary* session = s.asDictionary();
           if (!session) continue;
           const Value* started = session->find("started");
-          out += " " + textOf(*session, "reporterID") + " (" + textOf(*session, "serviceName") +
+          out += ' ';
+          out += textOf(*session, "reporterID") + " (" + textOf(*session, "serviceName") +
                  (started && started->asBool() && *started->asBool() ? ", started)" : ")");
         }
       }
@@ -226,7 +230,10 @@ std::string formatStatus(const Dictionary& status) {
   const Value* hits = status.find("limits_hit");
   if (!hits || !hits->asDictionary() || hits->asDictionary()->empty()) out += " none";
   else
-    for (const auto& [limit, count] : *hits->asDictionary()) out += " " + limit.text() + "=" + count.text();
+    for (const auto& [limit, count] : *hits->asDictionary()) {
+      out += ' ';
+      out += limit.text() + "=" + count.text();
+    }
   return out + "\n";
 }
 

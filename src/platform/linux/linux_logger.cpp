@@ -62,7 +62,9 @@ int LinuxLogger::syslogPriority(LogLevel level) {
 
 std::string LinuxLogger::formatLine(LogLevel level, const char* file, int line, const char* function,
                                     std::string_view message) {
-  std::string text = "<" + std::to_string(syslogPriority(level)) + ">";
+  std::string text = "<";
+  text += static_cast<char>('0' + syslogPriority(level));  // a single digit, 0 to 7
+  text += '>';
   text += file ? file : "";
   text += ':';
   text += std::to_string(line);
