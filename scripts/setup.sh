@@ -8,6 +8,8 @@ packages=(
   libsystemd-dev libsqlite3-dev nlohmann-json3-dev systemtap-sdt-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   dbus-daemon sqlite3 python3-dbusmock
+  # systemd-analyze checks the service units (nothing is started).
+  systemd
   # The tsan and fuzz presets: Clang 14, its sanitizer and libFuzzer runtimes,
   # and llvm-symbolizer for readable reports.
   clang libclang-rt-14-dev llvm

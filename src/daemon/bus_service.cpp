@@ -3,12 +3,15 @@
 #include <signal.h>
 #include <sys/epoll.h>
 #include <sys/signalfd.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <new>
 #include <optional>
+#include <utility>
 #include <vector>
 
 #include "daemon/pending_call.h"
@@ -94,6 +97,17 @@ void blockServiceSignals() {
 struct BusService::CredentialLookup {
   BusService* service;
   std::string name;
+  dbus::SlotRef slot;
+};
+
+// A connection that posted on the system bus: its uid once the bus answered, and
+// until then the names it posted (distinct, a few at most), in order.
+struct BusService::PostSender {
+  static constexpr std::size_t kMaxWaiting = 16;
+  BusService* service;
+  std::string name;
+  std::optional<std::uint32_t> uid;
+  std::vector<std::string> waiting;
   dbus::SlotRef slot;
 };
 
@@ -388,6 +402,8 @@ int BusService::open(const Options& options) {
   limits_ = options.limits;
   decodeLimits_ = {limits_.maxPayloadBytes, limits_.maxPayloadEntries, limits_.maxReporterIDsPerCall};
   status_ = options.status;
+  checkPostSender_ = options.bus == BusKind::System;
+  ownUid_ = geteuid();
   if ((r = sd_bus_add_object_vtable(bus_.get(), debugSlot_.out(), kObjectPath, kDebugInterfaceName, kDebugVtable,
                                     this)) < 0)
     return fail("exporting the status interface");
@@ -454,6 +470,7 @@ void BusService::close() {
   mailbox_->close();
   mailbox_->post([this] {
     lookups_.clear();
+    postSenders_.clear();
     objectSlot_.reset();
     orientationSlot_.reset();
     debugSlot_.reset();
@@ -555,6 +572,7 @@ int BusService::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_err
   try {
     auto& self = *static_cast<BusService*>(userdata);
     self.usage_.erase(name);
+    self.postSenders_.erase(name);
     self.registry_.nameVanished(name);
   } catch (...) {
   }
@@ -564,11 +582,64 @@ int BusService::onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_err
 int BusService::onPosted(sd_bus_message* m, void* userdata, sd_bus_error*) {
   const char* name = nullptr;
   if (sd_bus_message_read(m, "s", &name) < 0) return 0;
+  auto& self = *static_cast<BusService*>(userdata);
   try {
-    static_cast<BusService*>(userdata)->notifications_.post(name);
+    if (!self.checkPostSender_) {
+      self.notifications_.post(name);
+      return 0;
+    }
+    const char* senderName = sd_bus_message_get_sender(m);
+    if (!senderName) return 0;
+    auto& sender = self.postSenders_[senderName];
+    if (!sender) {
+      sender = std::make_unique<PostSender>(PostSender{&self, senderName, {}, {}, {}});
+      int r = sd_bus_call_method_async(self.bus_.get(), sender->slot.out(), kBusDriver, kBusDriverPath, kBusDriver,
+                                       "GetConnectionUnixUser", onPostSenderUid, sender.get(), "s", senderName);
+      if (r < 0) {
+        VR_LOG(self.logger_, LogScope::DefaultLog, LogLevel::Error, "BusService::onPosted",
+               "could not ask for the user of %s: %s", senderName, std::strerror(-r));
+        self.postSenders_.erase(senderName);
+        return 0;
+      }
+    }
+    if (sender->uid) {
+      self.postFrom(sender->name, *sender->uid, name);
+    } else if (std::find(sender->waiting.begin(), sender->waiting.end(), name) == sender->waiting.end()) {
+      // Posting a name again before the first is delivered changes nothing.
+      if (sender->waiting.size() < PostSender::kMaxWaiting) sender->waiting.emplace_back(name);
+    }
   } catch (...) {
   }
   return 0;
+}
+
+int BusService::onPostSenderUid(sd_bus_message* reply, void* userdata, sd_bus_error*) {
+  auto& sender = *static_cast<PostSender*>(userdata);
+  BusService& self = *sender.service;
+  std::uint32_t uid = 0;
+  if (sd_bus_message_is_method_error(reply, nullptr) || sd_bus_message_read(reply, "u", &uid) < 0) {
+    // Most likely gone already; what it posted is dropped, and a later post asks again.
+    // Erasing drops the slot too; sd-bus keeps its own reference while this runs.
+    const std::string name = sender.name;
+    self.postSenders_.erase(name);
+    return 0;
+  }
+  sender.uid = uid;
+  sender.slot.reset();
+  try {
+    for (const auto& name : std::exchange(sender.waiting, {})) self.postFrom(sender.name, uid, name);
+  } catch (...) {
+  }
+  return 0;
+}
+
+void BusService::postFrom(const std::string& sender, std::uint32_t uid, const std::string& name) {
+  if (uid == 0 || uid == ownUid_) {
+    notifications_.post(name);
+    return;
+  }
+  VR_DEBUG(logger_, LogScope::Server, "BusService::onPosted", "ignored the notification %s from %s (uid %u)",
+           name.c_str(), sender.c_str(), uid);
 }
 
 int BusService::onMailbox(sd_event_source*, int, std::uint32_t, void* userdata) {

@@ -1,7 +1,9 @@
 // The daemon on the bus: owns com.orvane.vireo.Reporting1, exports the
 // reporting interface at /com/orvane/vireo/Reporting1, turns bus unique names
 // into client connections for the listener delegate, and delivers the Posted
-// notification signal (and SIGHUP) to the notification center.
+// notification signal (and SIGHUP) to the notification center. On the system
+// bus a Posted signal counts only when root or the daemon's own user sent it:
+// the bus is asked for the sender's uid (asynchronously, once per connection).
 //
 // One thread runs the sd-event loop with the bus attached: the one that calls
 // run(), or the thread that start() makes. Method calls are parsed there and
@@ -96,6 +98,7 @@ class BusService {
  private:
   friend struct BusServiceAccess;
   struct CredentialLookup;
+  struct PostSender;
   using Invocation = std::function<void(VRReportingServiceProtocol& object, const std::shared_ptr<PendingCall>&)>;
 
   // What a client holds, counted against the limits; bus thread only.
@@ -116,6 +119,9 @@ class BusService {
   static int onCredentials(sd_bus_message* reply, void* userdata, sd_bus_error* error);
   static int onNameOwnerChanged(sd_bus_message* m, void* userdata, sd_bus_error* error);
   static int onPosted(sd_bus_message* m, void* userdata, sd_bus_error* error);
+  static int onPostSenderUid(sd_bus_message* reply, void* userdata, sd_bus_error* error);
+  // Posts name if uid may post notifications on this bus; logs it otherwise.
+  void postFrom(const std::string& sender, std::uint32_t uid, const std::string& name);
   static int onMailbox(sd_event_source* s, int fd, std::uint32_t revents, void* userdata);
   static int onSignal(sd_event_source* s, const struct signalfd_siginfo* info, void* userdata);
   int connect(const Options& options);
@@ -137,6 +143,9 @@ class BusService {
   std::function<void(Orientation)> interfaceOrientation_;  // set by open(), read on the bus thread
   dbus::EventSourceRef mailboxSource_, termSource_, intSource_, hupSource_;
   std::map<std::string, std::unique_ptr<CredentialLookup>> lookups_;  // by name; bus thread only
+  bool checkPostSender_ = false;  // set by open(): on the system bus
+  std::uint32_t ownUid_ = 0;      // set by open()
+  std::unordered_map<std::string, std::unique_ptr<PostSender>> postSenders_;  // by unique name; bus thread only
   std::thread thread_;  // the loop's thread when start() made one; owner's thread only
   bool closed_ = false; // owner's thread only
 };

@@ -1,5 +1,5 @@
 // What the end-to-end suite cannot see from a client: signal filtering,
-// introspection, the owned name.
+// the owned name.
 #include "daemon/bus_service.h"
 
 #include <gtest/gtest.h>
@@ -10,7 +10,6 @@
 #include <unistd.h>
 
 #include <chrono>
-#include <fstream>
 #include <thread>
 
 #include "fakes/fake_platform.h"
@@ -107,34 +106,6 @@ TEST_F(BusServiceTest, TheNameCanBeOwnedOnce) {
   ASSERT_GT(logger.size(), 0u);
   EXPECT_NE(logger.entries().back().message.find("could not acquire the name com.orvane.vireo.Reporting1"),
             std::string::npos);
-}
-
-// Our interfaces' blocks of an introspection document, whitespace dropped.
-std::string interfaceBlocks(std::string xml) {
-  std::erase_if(xml, [](unsigned char c) { return std::isspace(c); });
-  std::string blocks;
-  for (const char* name : {kInterfaceName, kDebugInterfaceName, kOrientationInterfaceName}) {
-    auto begin = xml.find(std::string("<interfacename=\"") + name + "\">");
-    blocks += begin == std::string::npos ? "" : xml.substr(begin, xml.find("</interface>", begin) - begin);
-  }
-  return blocks;
-}
-
-TEST_F(BusServiceTest, LiveIntrospectionMatchesTheInstalledInterface) {
-  dbus::BusError error;
-  dbus::MessageRef reply;
-  ASSERT_GE(sd_bus_call_method(client_.get(), kServiceName, kObjectPath, "org.freedesktop.DBus.Introspectable",
-                               "Introspect", error.get(), reply.out(), ""),
-            0)
-      << error.message();
-  const char* live = nullptr;
-  ASSERT_GE(sd_bus_message_read(reply.get(), "s", &live), 0);
-  std::ifstream file(VIREO_INTERFACE_XML);
-  ASSERT_TRUE(file) << VIREO_INTERFACE_XML;
-  auto expected = interfaceBlocks(std::string(std::istreambuf_iterator<char>(file), {}));
-  EXPECT_NE(expected.find("<methodname=\"CreateReportingSession\">"), std::string::npos);
-  EXPECT_NE(expected.find("<methodname=\"SetInterfaceOrientation\">"), std::string::npos);
-  EXPECT_EQ(interfaceBlocks(live), expected) << live;
 }
 
 }  // namespace
