@@ -5,6 +5,8 @@
 #include <chrono>
 #include <thread>
 
+#include "ctl/output.h"
+
 namespace vireo::ctl {
 
 namespace {
@@ -31,21 +33,14 @@ std::string boolText(bool b) { return b ? "true" : "false"; }
 
 }  // namespace
 
-void Runner::print(const std::string& text, const std::string& jsonLine) {
-  std::fprintf(out_, "%s\n", json_ ? jsonLine.c_str() : text.c_str());
+void Runner::print(const std::string& text, const json& line) {
+  if (json_) std::fprintf(out_, "%s\n", line.dump(-1, ' ', false, json::error_handler_t::replace).c_str());
+  else std::fprintf(out_, "%s\n", text.c_str());
   std::fflush(out_);
 }
 
 bool Runner::fail(const Operation& op, const client::Error& e) {
-  std::fprintf(err_, "vireoctl: %s: %s: %s\n", op.name.c_str(), e.name.c_str(), e.message.c_str());
-  if (json_) {
-    json err{{"name", e.name}, {"message", e.message}};
-    if (!e.domain.empty()) {
-      err["domain"] = e.domain;
-      err["code"] = e.code;
-    }
-    print("", json{{"op", op.name}, {"error", err}}.dump());
-  }
+  printError(err_, json_, {op.name, e.name, e.message, e.domain, e.code});
   return false;
 }
 
@@ -58,10 +53,11 @@ void Runner::reportArrivedStarts() {
       auto r = p.handle.wait();
       if (r)
         print("start " + std::to_string(id) + ": answered " + boolText(*r),
-              json{{"op", "start"}, {"reporterID", id}, {"answered", *r}}.dump());
+              json{{"op", "start"}, {"reporterID", id}, {"answered", *r}});
       else
-        std::fprintf(err_, "vireoctl: start %lld: %s: %s\n", static_cast<long long>(id), r.error().name.c_str(),
-                     r.error().message.c_str());
+        printError(err_, json_,
+                   {"start " + std::to_string(id), r.error().name, r.error().message, r.error().domain,
+                    r.error().code});
     }
   }
 }
@@ -82,7 +78,7 @@ bool Runner::waitStart(const Operation& op) {
   if (reported) return true;
   if (!*r) return fail(op, r->error());
   print("start " + std::to_string(op.id) + ": answered " + boolText(**r),
-        json{{"op", "start"}, {"reporterID", op.id}, {"answered", **r}}.dump());
+        json{{"op", "start"}, {"reporterID", op.id}, {"answered", **r}});
   return true;
 }
 
@@ -90,7 +86,7 @@ bool Runner::run(const Operation& op) {
   const std::string idText = std::to_string(op.id);
   auto boolResult = [&](const client::Result<bool>& r, const std::string& label) {
     if (!r) return fail(op, r.error());
-    print(label + ": " + boolText(*r), json{{"op", op.name}, {"reporterID", op.id}, {"result", *r}}.dump());
+    print(label + ": " + boolText(*r), json{{"op", op.name}, {"reporterID", op.id}, {"result", *r}});
     return true;
   };
   bool ok = true;
@@ -106,7 +102,7 @@ bool Runner::run(const Operation& op) {
       auto r = client_.getServiceNameForReporterID(op.id);
       if (!r) return fail(op, r.error());
       print("service-type " + idText + ": " + std::to_string(*r),
-            json{{"op", op.name}, {"reporterID", op.id}, {"serviceType", *r}}.dump());
+            json{{"op", op.name}, {"reporterID", op.id}, {"serviceType", *r}});
       break;
     }
     case OpKind::Configure:
@@ -116,7 +112,7 @@ bool Runner::run(const Operation& op) {
       if (op.startMode == StartMode::NoWait) {
         auto r = client_.startReportingSessionForIDNoWait(op.id);
         if (!r) return fail(op, r.error());
-        print("start " + idText + ": sent", json{{"op", "start"}, {"reporterID", op.id}, {"sent", true}}.dump());
+        print("start " + idText + ": sent", json{{"op", "start"}, {"reporterID", op.id}, {"sent", true}});
       } else {
         pending_[op.id].push_back({client_.startReportingSessionForID(op.id), false});
         if (op.startMode == StartMode::Wait) {
@@ -126,7 +122,7 @@ bool Runner::run(const Operation& op) {
           return waitStart(wait);
         }
         print("start " + idText + ": sent, answer pending",
-              json{{"op", "start"}, {"reporterID", op.id}, {"pending", true}}.dump());
+              json{{"op", "start"}, {"reporterID", op.id}, {"pending", true}});
       }
       break;
     case OpKind::Send: {
@@ -137,7 +133,7 @@ bool Runner::run(const Operation& op) {
       if (!r) return fail(op, r.error());
       json j{{"op", "send"}, {"category", op.category}, {"type", op.type}, {"result", "ok"}};
       j["to"] = ids ? idsJson(*ids) : json(nullptr);
-      print("send: ok", j.dump());
+      print("send: ok", j);
       break;
     }
     case OpKind::Stop:
@@ -151,25 +147,25 @@ bool Runner::run(const Operation& op) {
       if (!r) return fail(op, r.error());
       print("valid " + idText + ": reporterID=" + std::to_string(r->reporterID) +
                 " serviceType=" + std::to_string(r->serviceType),
-            json{{"op", "valid"}, {"reporterID", r->reporterID}, {"serviceType", r->serviceType}}.dump());
+            json{{"op", "valid"}, {"reporterID", r->reporterID}, {"serviceType", r->serviceType}});
       break;
     }
     case OpKind::List: {
       auto r = client_.getAllReporters();
       if (!r) return fail(op, r.error());
-      print("list: " + idsText(*r), json{{"op", "list"}, {"reporterIDs", idsJson(*r)}}.dump());
+      print("list: " + idsText(*r), json{{"op", "list"}, {"reporterIDs", idsJson(*r)}});
       break;
     }
     case OpKind::Kill: {
       auto r = client_.killService();
       if (!r) return fail(op, r.error());
-      print("kill: sent", json{{"op", "kill"}, {"sent", true}}.dump());
+      print("kill: sent", json{{"op", "kill"}, {"sent", true}});
       break;
     }
     case OpKind::Ping: {
       auto r = client_.ping();
       if (!r) return fail(op, r.error());
-      print("ping: ok", json{{"op", "ping"}, {"result", "ok"}}.dump());
+      print("ping: ok", json{{"op", "ping"}, {"result", "ok"}});
       break;
     }
     case OpKind::Sleep: {

@@ -7,6 +7,8 @@
 #include <map>
 #include <string>
 
+#include <nlohmann/json.hpp>
+
 #include "ctl/arguments.h"
 #include "vireo/client.h"
 
@@ -27,7 +29,7 @@ class Runner {
 
  private:
   bool fail(const Operation& op, const client::Error& e);
-  void print(const std::string& text, const std::string& jsonLine);
+  void print(const std::string& text, const nlohmann::ordered_json& line);
   bool waitStart(const Operation& op);
 
   client::Client& client_;

@@ -2,11 +2,14 @@
 
 #include <sqlite3.h>
 
+#include <sys/stat.h>
+
 #include <cmath>
 #include <ctime>
 #include <nlohmann/json.hpp>
 
 #include "ctl/arguments.h"
+#include "ctl/output.h"
 
 namespace vireo::ctl {
 
@@ -98,6 +101,38 @@ std::string columnText(sqlite3_stmt* st, int i, const std::string& name) {
   return p ? p : "";
 }
 
+json rowJson(sqlite3_stmt* st) {
+  json row = json::object();
+  for (int i = 0, n = sqlite3_column_count(st); i < n; ++i) {
+    std::string name = sqlite3_column_name(st, i);
+    row[name] = columnJson(st, i, name);
+  }
+  return row;
+}
+
+std::string rowText(sqlite3_stmt* st) {
+  std::string line;
+  for (int i = 0, n = sqlite3_column_count(st); i < n; ++i) {
+    std::string name = sqlite3_column_name(st, i);
+    if (i > 0) line += "  ";
+    line += name + "=" + columnText(st, i, name);
+  }
+  return line;
+}
+
+std::string dumpJson(const json& j, int indent = -1) {
+  return j.dump(indent, ' ', false, json::error_handler_t::replace);
+}
+
+void bindQuery(sqlite3_stmt* st, const StoreQuery& q) {
+  if (q.name) sqlite3_bind_text(st, 1, q.name->c_str(), -1, SQLITE_TRANSIENT);
+  if (q.session) sqlite3_bind_int64(st, 2, *q.session);
+  if (q.since) sqlite3_bind_double(st, 3, *q.since);
+  if (q.until) sqlite3_bind_double(st, 4, *q.until);
+  if (q.limit) sqlite3_bind_int64(st, 5, *q.limit);
+  if (q.after) sqlite3_bind_int64(st, 6, *q.after);
+}
+
 }  // namespace
 
 bool isStoreCommand(const std::string& word) { return findTable(word) != nullptr; }
@@ -161,6 +196,7 @@ std::string storeSql(const StoreQuery& q) {
   if (q.session) where.push_back(std::string(entry->sessionColumn) + " = ?2");
   if (q.since) where.push_back(std::string(entry->timeColumn) + " >= ?3");
   if (q.until) where.push_back(std::string(entry->timeColumn) + " <= ?4");
+  if (q.after) where.push_back(std::string(entry->idColumn) + " > ?6");
   for (size_t i = 0; i < where.size(); ++i) sql += (i == 0 ? " WHERE " : " AND ") + where[i];
   // The last N rows, shown oldest first.
   sql += std::string(" ORDER BY ") + entry->idColumn + (q.limit ? " DESC LIMIT ?5" : " ASC");
@@ -169,56 +205,112 @@ std::string storeSql(const StoreQuery& q) {
 }
 
 int runStoreQuery(const StoreQuery& q, std::FILE* out, std::FILE* err) {
+  auto storeError = [&](const std::string& message) {
+    printError(err, q.json, {q.table, kStoreError, message, {}, 0});
+    return 1;
+  };
   sqlite3* db = nullptr;
   if (sqlite3_open_v2(q.db.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-    std::fprintf(err, "vireoctl: cannot open the store %s: %s\n", q.db.c_str(), db ? sqlite3_errmsg(db) : "no memory");
+    std::string message = "cannot open the store " + q.db + ": " + (db ? sqlite3_errmsg(db) : "no memory");
     sqlite3_close(db);
-    return 1;
+    return storeError(message);
   }
   sqlite3_busy_timeout(db, 5000);
   std::string sql = storeSql(q);
   sqlite3_stmt* st = nullptr;
   if (sqlite3_prepare_v2(db, sql.c_str(), -1, &st, nullptr) != SQLITE_OK) {
-    std::fprintf(err, "vireoctl: cannot query the store %s: %s\n", q.db.c_str(), sqlite3_errmsg(db));
+    std::string message = "cannot query the store " + q.db + ": " + sqlite3_errmsg(db);
     sqlite3_close(db);
-    return 1;
+    return storeError(message);
   }
-  if (q.name) sqlite3_bind_text(st, 1, q.name->c_str(), -1, SQLITE_TRANSIENT);
-  if (q.session) sqlite3_bind_int64(st, 2, *q.session);
-  if (q.since) sqlite3_bind_double(st, 3, *q.since);
-  if (q.until) sqlite3_bind_double(st, 4, *q.until);
-  if (q.limit) sqlite3_bind_int64(st, 5, *q.limit);
-
+  bindQuery(st, q);
   json rows = json::array();
-  int columns = sqlite3_column_count(st);
   int rc;
   while ((rc = sqlite3_step(st)) == SQLITE_ROW) {
-    if (q.json) {
-      json row = json::object();
-      for (int i = 0; i < columns; ++i) {
-        std::string name = sqlite3_column_name(st, i);
-        row[name] = columnJson(st, i, name);
-      }
-      rows.push_back(std::move(row));
-    } else {
-      std::string line;
-      for (int i = 0; i < columns; ++i) {
-        std::string name = sqlite3_column_name(st, i);
-        if (i > 0) line += "  ";
-        line += name + "=" + columnText(st, i, name);
-      }
-      std::fprintf(out, "%s\n", line.c_str());
-    }
+    if (q.json) rows.push_back(rowJson(st));
+    else std::fprintf(out, "%s\n", rowText(st).c_str());
   }
-  int status = 0;
-  if (rc != SQLITE_DONE) {
-    std::fprintf(err, "vireoctl: reading the store failed: %s\n", sqlite3_errmsg(db));
-    status = 1;
-  }
+  std::string failure = rc == SQLITE_DONE ? "" : std::string("reading the store failed: ") + sqlite3_errmsg(db);
   sqlite3_finalize(st);
   sqlite3_close(db);
-  if (q.json && status == 0) std::fprintf(out, "%s\n", rows.dump(2).c_str());
-  return status;
+  if (!failure.empty()) return storeError(failure);
+  if (q.json) std::fprintf(out, "%s\n", dumpJson(rows, 2).c_str());
+  return 0;
+}
+
+std::vector<std::string> storeTables() {
+  std::vector<std::string> words;
+  for (const auto& t : kTables) words.emplace_back(t.word);
+  return words;
+}
+
+StoreWatcher::StoreWatcher(std::string db, std::vector<std::string> tables)
+    : path_(std::move(db)), tables_(std::move(tables)) {
+  if (tables_.empty()) tables_ = storeTables();
+}
+
+StoreWatcher::~StoreWatcher() { close(); }
+
+void StoreWatcher::close() {
+  sqlite3_close(db_);
+  db_ = nullptr;
+}
+
+bool StoreWatcher::open() {
+  struct stat info {};
+  if (::stat(path_.c_str(), &info) != 0) {
+    // Gone (or not there yet): whatever appears at this path later is a new store.
+    close();
+    after_.clear();
+    return false;
+  }
+  if (db_ && info.st_dev == device_ && info.st_ino == inode_) return true;
+  close();
+  after_.clear();
+  if (sqlite3_open_v2(path_.c_str(), &db_, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
+    close();
+    return false;
+  }
+  sqlite3_busy_timeout(db_, 1000);
+  device_ = info.st_dev;
+  inode_ = info.st_ino;
+  return true;
+}
+
+int StoreWatcher::poll(std::FILE* out, bool asJson) {
+  const bool first = firstPoll_;
+  firstPoll_ = false;
+  if (!open()) return 0;
+  int printed = 0;
+  for (const auto& table : tables_) {
+    StoreQuery q;
+    q.table = table;
+    auto cursor = after_.find(table);
+    if (cursor != after_.end()) q.after = cursor->second;
+    if (first) q.limit = 1;  // only where the table ends
+    sqlite3_stmt* st = nullptr;
+    // A table the daemon has not created yet is simply empty for now.
+    if (sqlite3_prepare_v2(db_, storeSql(q).c_str(), -1, &st, nullptr) != SQLITE_OK) continue;
+    bindQuery(st, q);
+    std::int64_t last = cursor != after_.end() ? cursor->second : 0;
+    while (sqlite3_step(st) == SQLITE_ROW) {
+      last = sqlite3_column_int64(st, 0);
+      // Rows already there when the watch began are history, not news.
+      if (first) continue;
+      if (asJson) {
+        json row{{"table", table}};
+        row.update(rowJson(st));
+        std::fprintf(out, "%s\n", dumpJson(row).c_str());
+      } else {
+        std::fprintf(out, "%s: %s\n", table.c_str(), rowText(st).c_str());
+      }
+      ++printed;
+    }
+    sqlite3_finalize(st);
+    after_[table] = last;
+  }
+  if (printed) std::fflush(out);
+  return printed;
 }
 
 }  // namespace vireo::ctl

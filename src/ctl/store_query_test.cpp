@@ -6,6 +6,7 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <tuple>
 
 #include "fakes/fake_platform.h"
@@ -38,6 +39,26 @@ class StoreQueryTest : public ::testing::Test {
     store.insertAnalyticsEvent("com.orvane.vireo.vrreportingclientuptime", Dictionary{{"seconds", 2.5}}, 250);
     store.insertEnergyEvent(7, "Lumen_Haptics", Dictionary{{"EngineOnDuration", 3}}, 160);
     ASSERT_TRUE(store.flush(std::chrono::seconds(10)));
+  }
+
+  // Writes one analytics event with the daemon's store (opened for the call alone).
+  void addEvent(const std::string& dir, const std::string& name) {
+    testing::RecordingLogger logger;
+    linux_platform::SystemClock clock;
+    linux_platform::LocalStore store(dir, logger, clock);
+    store.insertAnalyticsEvent(name, Dictionary{{"n", 1}}, 400);
+    store.insertEnergyEvent(1, name, Dictionary{}, 400);
+    ASSERT_TRUE(store.flush(std::chrono::seconds(10)));
+  }
+  static std::string poll(StoreWatcher& w, bool json = false) {
+    char* buf = nullptr;
+    std::size_t size = 0;
+    std::FILE* out = open_memstream(&buf, &size);
+    w.poll(out, json);
+    std::fclose(out);
+    std::string text(buf, size);
+    std::free(buf);
+    return text;
   }
 
   // Runs a query and returns its standard output.
@@ -101,6 +122,32 @@ TEST_F(StoreQueryTest, TextOutputUsageAndMissingStore) {
   ASSERT_TRUE(q);
   q->db = dir_ + "/missing.db";
   EXPECT_EQ(runStoreQuery(*q, stdout, stdout), 1);
+}
+
+// Only rows added after the watch began; a store that appears (or is replaced) later
+// is shown from its first row.
+TEST_F(StoreQueryTest, WatchFollowsNewRowsAcrossAMissingAndAReplacedFile) {
+  StoreWatcher existing(db_, {"analytics"});
+  EXPECT_EQ(poll(existing), "");
+  addEvent(dir_, "new");
+  auto line = nlohmann::json::parse(poll(existing, true));  // one line: the energy row is not watched
+  EXPECT_EQ(line["table"], "analytics");
+  EXPECT_EQ(line["id"], 3);
+  EXPECT_EQ(line["payload"]["n"], 1);
+  EXPECT_EQ(poll(existing), "");
+
+  const std::string later = dir_ + "/later";
+  StoreWatcher waiting(later + "/vireo.db", {});
+  EXPECT_EQ(poll(waiting), "");
+  addEvent(later, "first");
+  std::string text = poll(waiting);
+  EXPECT_NE(text.find("analytics: id=1  name=first"), std::string::npos) << text;
+  EXPECT_NE(text.find("energy: id=1  client=1  name=first"), std::string::npos) << text;
+  std::filesystem::remove_all(later);
+  EXPECT_EQ(poll(waiting), "");
+  addEvent(later, "again");
+  text = poll(waiting);
+  EXPECT_NE(text.find("analytics: id=1  name=again"), std::string::npos) << text;
 }
 
 }  // namespace
