@@ -13,6 +13,9 @@ packages=(
   # The tsan and fuzz presets: Clang 14, its sanitizer and libFuzzer runtimes,
   # and llvm-symbolizer for readable reports.
   clang libclang-rt-14-dev llvm
+  # The Debian package: cpack's shlibdeps needs file(1) (dpkg-dev comes with
+  # build-essential); lintian checks the package, with man-db for the manual pages.
+  file lintian man-db
 )
 
 missing=()
