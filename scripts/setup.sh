@@ -16,6 +16,9 @@ packages=(
   # The Debian package: cpack's shlibdeps needs file(1) (dpkg-dev comes with
   # build-essential); lintian checks the package, with man-db for the manual pages.
   file lintian man-db
+  # The forwarder: libcurl for ClickHouse's HTTP interface; its tests start their own
+  # ClickHouse server.
+  libcurl4-openssl-dev clickhouse-server clickhouse-client
 )
 
 missing=()

@@ -114,12 +114,6 @@ struct Options {
   double timeout = 25;
 };
 
-std::string env(const char* name) {
-  const char* v = std::getenv(name);
-  return v ? v : "";
-}
-
-
 // Where the daemon keeps its files: the same rules it follows itself (a trial daemon
 // started by scripts/run.sh has its directories in the line that script prints).
 linux_platform::ServiceDirectories directories() {

@@ -9,6 +9,8 @@
 #include <iterator>
 #include <utility>
 
+#include "platform/linux/store/change_log.h"
+
 namespace vireo::linux_platform {
 
 namespace {
@@ -179,7 +181,7 @@ bool LocalStore::openDatabase(const std::string& stateDirectory) {
     logError("LocalStore::open", "cannot set up the store");
     return false;
   }
-  if (!exec(kSchema) || !exec("COMMIT")) {
+  if (!exec(kSchema) || !exec(kChangeLogSchema) || !exec("COMMIT")) {
     logError("LocalStore::open", "cannot create the schema");
     exec("ROLLBACK");
     return false;
