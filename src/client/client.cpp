@@ -689,6 +689,15 @@ Status Client::postNotification(const std::string& name) noexcept {
     int r = sd_bus_emit_signal(conn_->bus, bus::kNotifyPath, bus::kNotifyInterface, "Posted", "s", name.c_str());
     if (r >= 0) r = sd_bus_flush(conn_->bus);
     if (r < 0) return errorFromErrno(r, "cannot post the notification");
+    // On the system bus the daemon asks the bus who posted, which needs this connection
+    // still there. Its answer to a ping leaves after it has read the post and asked, so
+    // staying for that answer is enough. The ping neither starts a daemon that is not
+    // running nor decides the outcome: the post is out either way.
+    Message ping;
+    if (sd_bus_message_new_method_call(conn_->bus, &ping.m, kServiceName, kObjectPath, "org.freedesktop.DBus.Peer",
+                                       "Ping") >= 0 &&
+        sd_bus_message_set_auto_start(ping.m, 0) >= 0)
+      sd_bus_call(conn_->bus, ping.m, conn_->timeoutUsec, nullptr, nullptr);
     return Done{};
   } catch (...) {
     return outOfMemory();

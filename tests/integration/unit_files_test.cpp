@@ -67,12 +67,12 @@ TEST_F(UnitFilesTest, VerifyCleanAndSystemUnitRatedSafe) {
   const std::string system = configure("vireo-reportingd.service.in", "vireo-reportingd.service");
   const std::string user = configure("user/vireo-reportingd.service.in", "user/vireo-reportingd.service");
 
-  Result verify = run("systemd-analyze verify " + system);
+  Result verify = run("systemd-analyze verify --man=no " + system);
   EXPECT_EQ(verify.status, 0);
   EXPECT_EQ(verify.output, "");
   // A user manager of its own: nothing from the caller's home directory.
   verify = run("env -u XDG_CONFIG_HOME -u XDG_DATA_HOME HOME=" + dir_ + " XDG_RUNTIME_DIR=" + dir_ +
-               "/xdg systemd-analyze --user verify " + user);
+               "/xdg systemd-analyze --user verify --man=no " + user);
   EXPECT_EQ(verify.status, 0);
   EXPECT_EQ(verify.output, "");
 
