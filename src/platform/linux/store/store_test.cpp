@@ -83,10 +83,10 @@ TEST_F(StoreTest, CreatesThePublishedSchemaInWalMode) {
   EXPECT_EQ(reader.scalar("SELECT group_concat(\"table\" || '(' || \"to\" || ')<-' || \"from\") "
                           "FROM pragma_foreign_key_list('telemetry_messages')"),
             "telemetry_sessions(id)<-session");
-  // Besides them only the forwarder's cursors and change log.
+  // Besides them only the forwarder's cursors and change log, and the quota's counts.
   EXPECT_EQ(reader.scalar("SELECT group_concat(name) FROM (SELECT name FROM sqlite_master WHERE type='table' "
                           "ORDER BY name)"),
-            "analytics_events,energy_events,forward_state,sqlite_sequence,store_changes,telemetry_messages,"
+            "analytics_events,energy_events,forward_state,sqlite_sequence,store_changes,store_dropped,telemetry_messages,"
             "telemetry_sessions");
   EXPECT_EQ(reader.scalar("PRAGMA journal_mode"), "wal");
 }
