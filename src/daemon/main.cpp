@@ -22,6 +22,7 @@
 #include "platform/linux/device_properties.h"
 #include "platform/linux/diagnostic_files.h"
 #include "platform/linux/limits_file.h"
+#include "platform/linux/store/store_quota.h"
 #include "platform/linux/linux_logger.h"
 #include "platform/linux/paths.h"
 #include "platform/linux/process_table.h"
@@ -77,6 +78,7 @@ Dictionary storeStatus(const linux_platform::LocalStore& store) {
                     {"refused_rows", Value(static_cast<unsigned long long>(s.refusedRows))},
                     {"dropped_bad_rows", Value(static_cast<unsigned long long>(s.droppedBadRows))},
                     {"write_errors", Value(static_cast<unsigned long long>(s.writeErrors))},
+                    {"quota_dropped_rows", Value(static_cast<unsigned long long>(s.quotaDroppedRows))},
                     {"last_error", Value(s.lastError)}};
 }
 
@@ -141,6 +143,11 @@ int main(int argc, char** argv) {
   ThreadPoolDispatcher dispatcher;
   linux_platform::LocalStore::Options storeOptions;
   storeOptions.maxPendingRows = limits.maxQueuedRows;
+  std::string quotaProblem;
+  storeOptions.maxStoreBytes =
+      linux_platform::readMaxStoreBytes(directories.configuration + "/telemetry.conf", &quotaProblem);
+  if (!quotaProblem.empty())
+    VR_LOG(*logger, LogScope::DefaultLog, LogLevel::Error, "main", "telemetry.conf: %s", quotaProblem.c_str());
   linux_platform::LocalStoreServices store(directories, *logger, clock, storeOptions);
   linux_platform::SuiteFileDefaultsStore defaults(directories.configuration);
   daemon::NotificationCenter notifications;

@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "platform/linux/store/change_log.h"
+#include "platform/linux/store/store_quota.h"
 
 namespace vireo::linux_platform {
 
@@ -370,7 +371,8 @@ bool LocalStore::flush(std::chrono::milliseconds timeout, std::uint64_t since) {
 
 StoreStatus LocalStore::status() const {
   MutexLock lock(mutex_);
-  return StoreStatus{pendingRows_, pendingBytes_, refusedRows_, droppedBadRows_, writeErrors_, lastError_, usable()};
+  return StoreStatus{pendingRows_, pendingBytes_,     refusedRows_, droppedBadRows_,
+                     writeErrors_, quotaDroppedRows_, lastError_,  usable()};
 }
 
 void LocalStore::close() {
@@ -477,6 +479,7 @@ void LocalStore::writerLoop() {
     std::string error;
     const bool ok = writeBatch(batch, &error, &badError);
     cacheHeld = true;
+    if (ok && options_.maxStoreBytes > 0) enforceQuota();
     if (ok) {
       if (const auto bad = std::ranges::count(batch, true, &Row::bad); bad > 0) {
         VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Error, "LocalStore::writerLoop",
@@ -512,6 +515,24 @@ void LocalStore::writerLoop() {
       finishBatch(batch, !ok);
     }
   }
+}
+
+void LocalStore::enforceQuota() {
+  const QuotaPass pass = enforceStoreQuota(db_, options_.maxStoreBytes);
+  const std::uint64_t deleted = pass.forwarded + pass.unforwarded;
+  if (deleted == 0 && pass.error.empty()) return;
+  {
+    MutexLock lock(mutex_);
+    quotaDroppedRows_ += deleted;
+    if (!pass.error.empty()) lastError_ = pass.error;
+  }
+  VR_LOG(logger_, LogScope::DefaultLog, pass.error.empty() ? LogLevel::Default : LogLevel::Error,
+         "LocalStore::enforceQuota",
+         "%s: %lld bytes in use, over MaxStoreBytes=%lld: deleted %llu rows already forwarded and %llu not "
+         "forwarded, %lld bytes in use now%s%s",
+         path_.c_str(), static_cast<long long>(pass.usedBefore), static_cast<long long>(options_.maxStoreBytes),
+         static_cast<unsigned long long>(pass.forwarded), static_cast<unsigned long long>(pass.unforwarded),
+         static_cast<long long>(pass.usedAfter), pass.error.empty() ? "" : "; stopped: ", pass.error.c_str());
 }
 
 bool LocalStore::writeBatch(std::vector<Row>& batch, std::string* error, std::string* badError) {

@@ -37,6 +37,7 @@ struct StoreStatus {
   std::uint64_t refusedRows = 0;    // refused at insert: queue full, or closed/unusable store
   std::uint64_t droppedBadRows = 0; // rows the database refused on their own
   std::uint64_t writeErrors = 0;    // failed write attempts (each retried)
+  std::uint64_t quotaDroppedRows = 0;  // rows the disk quota deleted since the start
   std::string lastError;            // of the last failed attempt or dropped row, "" if none
   bool usable = false;
 };
@@ -63,6 +64,9 @@ class LocalStore {
     std::size_t groupRows = 256;
     // After this long without rows the writer hands SQLite's page cache back.
     std::chrono::milliseconds releaseCacheAfter{500};
+    // The disk quota (store_quota.h): pages in use past it make the writer delete
+    // rows after its commit. 0: none.
+    std::int64_t maxStoreBytes = 0;
   };
 
   // Opens (creating it and its directory) STATE/vireo.db. A store that cannot be
@@ -129,6 +133,7 @@ class LocalStore {
   void finishBatch(std::vector<Row>& batch, bool dropAll) VIREO_REQUIRES(mutex_);
   void noteDropped(std::uint64_t first, std::uint64_t last) VIREO_REQUIRES(mutex_);
   bool droppedAfter(std::uint64_t since, std::uint64_t upTo) const VIREO_REQUIRES(mutex_);
+  void enforceQuota();
   bool exec(const char* sql);
   void logError(const char* function, const char* what);
   void finalizeDatabase();
@@ -161,6 +166,7 @@ class LocalStore {
   std::uint64_t refusedRows_ VIREO_GUARDED_BY(mutex_) = 0;
   std::uint64_t droppedBadRows_ VIREO_GUARDED_BY(mutex_) = 0;
   std::uint64_t writeErrors_ VIREO_GUARDED_BY(mutex_) = 0;
+  std::uint64_t quotaDroppedRows_ VIREO_GUARDED_BY(mutex_) = 0;
   std::string lastError_ VIREO_GUARDED_BY(mutex_);
   bool overflowing_ VIREO_GUARDED_BY(mutex_) = false;  // refusing since the queue last went below half its limits
   bool stopping_ VIREO_GUARDED_BY(mutex_) = false;

@@ -16,6 +16,7 @@
 
 #include "platform/linux/store/analytics_service.h"
 #include "platform/linux/store/energy_log_service.h"
+#include "platform/linux/store/store_quota.h"
 #include "platform/linux/store/telemetry_service.h"
 #include "fakes/fake_platform.h"
 #include "fakes/temp_dir.h"
@@ -137,6 +138,49 @@ TEST_F(StoreTest, LockedStoreKeepsEveryRowUntilItCanWriteAndRefusesPastItsLimit)
   EXPECT_FALSE(store.insertAnalyticsEvent("closed", Dictionary{}, 3.0));
   ASSERT_TRUE(blocker.exec("COMMIT"));
   EXPECT_EQ(blocker.scalar("SELECT group_concat(DISTINCT name) FROM analytics_events"), "held,after");
+}
+
+// Past the quota, rows already forwarded go first, then the oldest, whichever table
+// holds them; each table's newest row and every open forwarded session stay; what goes
+// is counted per table.
+TEST_F(StoreTest, QuotaDeletesForwardedRowsFirstThenTheOldestAndCountsThem) {
+  constexpr std::int64_t kQuota = 512 << 10;
+  LocalStore store(state(), logger, clock, {.maxStoreBytes = kQuota});
+  const Dictionary payload{{"pad", std::string(900, 'x')}};
+  const auto open = store.insertTelemetrySession({}, {}, 1.0);
+  ASSERT_TRUE(open && store.insertEnergyEvent(1, "early", payload, 2.0));
+  for (int i = 0; i < 100; ++i) ASSERT_TRUE(store.insertTelemetryMessage(*open, nullptr, nullptr, 1, 1, payload, 10.0 + i));
+  ASSERT_TRUE(store.flush(5s));
+  Reader reader(db());
+  // The forwarder has sent the first 100 messages and the open session.
+  ASSERT_TRUE(reader.exec("INSERT INTO forward_state VALUES ('telemetry_messages', 100), ('telemetry_sessions', 1)"));
+  ASSERT_TRUE(store.insertEnergyEvent(1, "late", payload, 1300.0));
+  for (int i = 0; i < 1000; ++i)
+    ASSERT_TRUE(store.insertTelemetryMessage(*open, nullptr, nullptr, 1, 1, payload, 200.0 + i));
+  ASSERT_TRUE(store.flush(5s));
+
+  EXPECT_LE(std::stoll(reader.scalar("SELECT (SELECT page_count FROM pragma_page_count) - "
+                                     "(SELECT freelist_count FROM pragma_freelist_count)")) *
+                std::stoll(reader.scalar("PRAGMA page_size")),
+            kQuota);
+  const std::int64_t kept = std::stoll(reader.scalar("SELECT COUNT(*) FROM telemetry_messages"));
+  const std::int64_t unforwarded = std::stoll(
+      reader.scalar("SELECT unforwarded FROM store_dropped WHERE tbl = 'telemetry_messages'"));
+  EXPECT_EQ(reader.scalar("SELECT forwarded FROM store_dropped WHERE tbl = 'telemetry_messages'"), "100");
+  // The energy row of time 2 was older than every message left: it went with them.
+  EXPECT_EQ(reader.scalar("SELECT unforwarded FROM store_dropped WHERE tbl = 'energy_events'"), "1");
+  EXPECT_EQ(kept + 100 + unforwarded, 1100);
+  EXPECT_EQ(reader.scalar("SELECT MIN(id) FROM telemetry_messages"), std::to_string(1101 - kept));
+  EXPECT_EQ(reader.scalar("SELECT group_concat(name) FROM energy_events"), "late");
+  EXPECT_EQ(reader.scalar("SELECT COUNT(*) FROM telemetry_sessions"), "1");
+  EXPECT_EQ(store.status().quotaDroppedRows, static_cast<std::uint64_t>(101 + unforwarded));
+  EXPECT_GE(logger.count("over MaxStoreBytes=524288"), 1u);
+  EXPECT_EQ(errors(), 0u);
+
+  EXPECT_EQ(parseByteSize(" 64M"), std::int64_t{64} << 20);
+  EXPECT_EQ(parseByteSize("1g"), std::int64_t{1} << 30);
+  EXPECT_EQ(parseByteSize("4096"), 4096);
+  for (const char* bad : {"", "M", "-1K", "1.5G", "1KB", "99999999999T"}) EXPECT_EQ(parseByteSize(bad), std::nullopt) << bad;
 }
 
 TEST_F(StoreTest, FlushedRowsSurviveSigkillAndIdsContinue) {
