@@ -7,6 +7,10 @@
 --   SELECT count() FROM vireo.telemetry_messages FINAL
 -- counts every local row once, in its latest state.
 --
+-- store_dropped: the rows the device's disk quota deleted, per local table, those
+-- already forwarded and those lost to this database. The counts only grow, so their
+-- sum is the version and FINAL shows the latest; at is the device's time of the pass.
+--
 -- vireo-forwarder runs these statements itself when a table is missing, with the
 -- database of Database= in place of vireo. By hand:
 --   clickhouse-client --multiquery < clickhouse.sql
@@ -55,3 +59,12 @@ CREATE TABLE IF NOT EXISTS vireo.energy_events (
   `at`         Float64,
   version      UInt64
 ) ENGINE = ReplacingMergeTree(version) ORDER BY (device, id);
+
+CREATE TABLE IF NOT EXISTS vireo.store_dropped (
+  device       String,
+  tbl          String,
+  forwarded    UInt64,
+  unforwarded  UInt64,
+  `at`         Float64,
+  version      UInt64
+) ENGINE = ReplacingMergeTree(version) ORDER BY (device, tbl);

@@ -18,6 +18,7 @@
 #include "base/value.h"
 #include "ctl/arguments.h"
 #include "ctl/defaults_command.h"
+#include "ctl/forwarder_command.h"
 #include "ctl/output.h"
 #include "ctl/runner.h"
 #include "ctl/store_query.h"
@@ -33,6 +34,7 @@ constexpr const char* kHelp = R"(usage: vireoctl [OPTIONS] OPERATION [ARGS...] [
        vireoctl [OPTIONS] defaults read [KEY] | write KEY VALUE... | delete KEY
        vireoctl [OPTIONS] sessions|messages|analytics|energy [FILTERS]   rows of the store
        vireoctl [OPTIONS] watch [TABLE...] [--db PATH]   new rows of the store, until Ctrl-C
+       vireoctl [OPTIONS] forwarder [--db PATH]   what vireo-forwarder has sent and what waits
 
 A reporting session lives only as long as the connection of the client that made it,
 so all operations of one invocation run in order on one connection. Separate them
@@ -83,11 +85,17 @@ watch prints each row added to the given tables (default: all four) as it lands,
 every 200 ms, until SIGINT or SIGTERM (exit status 0). Rows already stored are not shown;
 the file may appear later, or be replaced, and is followed from its first row then.
 
+forwarder shows vireo-forwarder's state: whether CONFIGURATION_DIRECTORY/forwarder.conf
+exists; from STATE_DIRECTORY/forwarder.json (written after each pass) the device, consent,
+last success, last error and next attempt; and per table, read from the store, the cursor
+(last id sent), the backlog (rows past it) and the rows the disk quota deleted, already
+forwarded or not. A store the forwarder never opened shows cursor 0 and every row waiting.
+
 Options:
   --json               JSON on standard output: one object per line for operations, notify,
                        orientation, defaults write/delete and watch; one document for status,
-                       defaults read and store queries (an array of rows). Errors are then one
-                       JSON object per line on standard error:
+                       defaults read, forwarder and store queries (an array of rows). Errors
+                       are then one JSON object per line on standard error:
                        {"op":"send","error":{"name":"...","message":"..."}} (plus "domain" and
                        "code" for the reporting-disabled error); without --json they are text.
   --bus system|session the bus to use (default: VIREO_BUS, else system for root,
@@ -299,6 +307,11 @@ int main(int argc, char** argv) {
     return 0;
   }
   if (command == "watch") return runWatch(o, rest);
+  if (command == "forwarder") {
+    const auto d = directories();
+    return ctl::runForwarder({d.state + "/vireo.db", d.state + "/forwarder.json", d.configuration + "/forwarder.conf"},
+                             rest, o.json, stdout, stderr);
+  }
   if (ctl::isStoreCommand(command)) {
     std::string error;
     auto q = ctl::parseStoreQuery(command, rest, &error);

@@ -19,6 +19,7 @@ struct ErrorReport {
 inline constexpr const char* kUsageError = "com.orvane.vireoctl.UsageError";
 inline constexpr const char* kStoreError = "com.orvane.vireoctl.StoreError";
 inline constexpr const char* kDefaultsError = "com.orvane.vireoctl.DefaultsError";
+inline constexpr const char* kForwarderError = "com.orvane.vireoctl.ForwarderError";
 
 // Text: "vireoctl: OP: NAME: MESSAGE" (usage errors: "vireoctl: MESSAGE" and a hint).
 // JSON: {"op":OP,"error":{"name":NAME,"message":MESSAGE[,"domain":D,"code":C]}}.

@@ -60,21 +60,6 @@ bool isTimeColumn(const std::string& name) {
   return name == "created_at" || name == "flushed_at" || name == "sent_at" || name == "at";
 }
 
-std::string isoTime(double t) {
-  auto secs = static_cast<time_t>(std::floor(t));
-  int millis = static_cast<int>(std::lround((t - std::floor(t)) * 1000));
-  if (millis == 1000) {
-    ++secs;
-    millis = 0;
-  }
-  std::tm tm{};
-  gmtime_r(&secs, &tm);
-  char buf[64];
-  std::snprintf(buf, sizeof buf, "%04d-%02d-%02dT%02d:%02d:%02d.%03dZ", tm.tm_year + 1900, tm.tm_mon + 1,
-                tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec, millis);
-  return buf;
-}
-
 json columnJson(sqlite3_stmt* st, int i, const std::string& name) {
   switch (sqlite3_column_type(st, i)) {
     case SQLITE_NULL: return nullptr;
@@ -134,6 +119,21 @@ void bindQuery(sqlite3_stmt* st, const StoreQuery& q) {
 }
 
 }  // namespace
+
+std::string isoTime(double t) {
+  auto secs = static_cast<time_t>(std::floor(t));
+  int millis = static_cast<int>(std::lround((t - std::floor(t)) * 1000));
+  if (millis == 1000) {
+    ++secs;
+    millis = 0;
+  }
+  std::tm tm{};
+  gmtime_r(&secs, &tm);
+  char buf[64];
+  std::snprintf(buf, sizeof buf, "%04d-%02d-%02dT%02d:%02d:%02d.%03dZ", tm.tm_year + 1900, tm.tm_mon + 1,
+                tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec, millis);
+  return buf;
+}
 
 bool isStoreCommand(const std::string& word) { return findTable(word) != nullptr; }
 

@@ -34,6 +34,8 @@ std::string storeSql(const StoreQuery& q);
 int runStoreQuery(const StoreQuery& q, std::FILE* out, std::FILE* err);
 // sessions, messages, analytics, energy
 std::vector<std::string> storeTables();
+// Unix seconds as UTC ISO 8601 with milliseconds, as the store queries print times.
+std::string isoTime(double unixSeconds);
 
 // Follows a store file for new rows by row id, read-only. The file may not exist
 // yet, and may be replaced (a new file starts over from its first row).

@@ -31,7 +31,8 @@ int progress(void* cancelled, curl_off_t, curl_off_t, curl_off_t, curl_off_t) {
   return (*static_cast<std::function<bool()>*>(cancelled))() ? 1 : 0;
 }
 
-constexpr const char* kTables[] = {"telemetry_sessions", "telemetry_messages", "analytics_events", "energy_events"};
+constexpr const char* kTables[] = {"telemetry_sessions", "telemetry_messages", "analytics_events", "energy_events",
+                                   "store_dropped"};
 
 }  // namespace
 

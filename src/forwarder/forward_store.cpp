@@ -249,6 +249,18 @@ bool ForwardStore::commit(std::string_view name, std::int64_t value, std::string
   return false;
 }
 
+bool ForwardStore::dropped(std::map<std::string, DroppedCount>* counts, std::string* error) {
+  counts->clear();
+  Statement s(db_, "SELECT tbl, forwarded, unforwarded FROM store_dropped");
+  int rc;
+  while ((rc = s.step()) == SQLITE_ROW) {
+    const auto* name = reinterpret_cast<const char*>(sqlite3_column_text(s.get(), 0));
+    (*counts)[name ? name : ""] = {sqlite3_column_int64(s.get(), 1), sqlite3_column_int64(s.get(), 2)};
+  }
+  if (rc != SQLITE_DONE) return fail(error, "cannot read the dropped counts");
+  return true;
+}
+
 std::int64_t ForwardStore::backlog(std::string_view table, std::int64_t cursor) {
   const bool changes = table == kChangesName;
   Statement s(db_, std::string("SELECT COUNT(*) FROM \"") + std::string(table) + "\" WHERE " +

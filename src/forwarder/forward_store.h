@@ -9,6 +9,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -33,6 +34,14 @@ struct ForwardedTable {
 // The four tables of the store, in the order a pass sends them.
 const std::vector<ForwardedTable>& forwardedTables();
 inline constexpr const char* kChangesName = "store_changes";
+// The forward_state name of the dropped counts' total last sent.
+inline constexpr const char* kDroppedName = "store_dropped";
+
+// Rows of one table the daemon's disk quota deleted: already sent, or never.
+struct DroppedCount {
+  std::int64_t forwarded = 0;
+  std::int64_t unforwarded = 0;
+};
 
 // Rows of one table (or of the change log) as JSONEachRow text.
 struct Batch {
@@ -65,6 +74,8 @@ class ForwardStore {
   bool readChanges(std::int64_t after, std::int64_t limit, std::string_view device, Batch* batch, std::string* error);
   // Stores the cursor in one transaction; the change log's also deletes the entries it covers.
   bool commit(std::string_view name, std::int64_t value, std::string* error);
+  // store_dropped, by table; tables without a row are left out.
+  bool dropped(std::map<std::string, DroppedCount>* counts, std::string* error);
   // Rows (entries) past the cursor.
   std::int64_t backlog(std::string_view table, std::int64_t cursor);
   // Deletes forwarded rows older than cutoff in small transactions, keeping each

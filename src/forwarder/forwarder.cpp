@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -60,6 +61,31 @@ bool Forwarder::sendBatch(const char* table, const Batch& batch, std::string* er
   return true;
 }
 
+bool Forwarder::sendDropped(std::string* error) {
+  std::map<std::string, DroppedCount> counts;
+  std::int64_t sent = 0;
+  if (!store_->dropped(&counts, error) || !store_->cursor(kDroppedName, &sent, error)) return false;
+  // The counts only grow, so their total tells whether any changed.
+  std::int64_t total = 0;
+  for (const auto& [table, count] : counts) total += count.forwarded + count.unforwarded;
+  if (total == sent) return true;
+  using Json = nlohmann::json;
+  const double now = unixNow();
+  std::string body;
+  for (const auto& [table, count] : counts) {
+    const auto forwarded = static_cast<std::uint64_t>(std::max<std::int64_t>(count.forwarded, 0));
+    const auto unforwarded = static_cast<std::uint64_t>(std::max<std::int64_t>(count.unforwarded, 0));
+    if (forwarded + unforwarded == 0) continue;
+    const Json row = {{"device", device_},         {"tbl", table}, {"forwarded", forwarded},
+                      {"unforwarded", unforwarded}, {"at", now},    {"version", forwarded + unforwarded}};
+    body += row.dump(-1, ' ', false, Json::error_handler_t::replace) + "\n";
+  }
+  if (!body.empty() &&
+      !client_.post("INSERT INTO " + config_.database + "." + kDroppedName + " FORMAT JSONEachRow", body, error))
+    return false;
+  return store_->commit(kDroppedName, total, error);
+}
+
 Forwarder::Result Forwarder::pass() {
   std::string error;
   if (!openStore(&error)) {
@@ -105,6 +131,8 @@ Forwarder::Result Forwarder::pass() {
     sentNow[kChangesName] += changes.rows;
     more = more || changes.entries == config_.batchRows;
   }
+  if (hooks_.cancelled()) return Result::Stopped;
+  if (hooks_.consent() && !sendDropped(&error)) return fail(error);
   if (failures_ > 0) {
     VR_LOG(logger_, LogScope::DefaultLog, LogLevel::Default, "Forwarder::pass",
            "forwarding again after %llu failed attempts", static_cast<unsigned long long>(failures_));
@@ -156,6 +184,12 @@ void Forwarder::writeStatus(const std::string& path, bool consent, double nextAt
   };
   for (const auto& t : forwardedTables()) table(t.name);
   table(kChangesName);
+  Json dropped = Json::object();
+  std::map<std::string, DroppedCount> counts;
+  if (store_ && store_->dropped(&counts, &error)) {
+    for (const auto& [name, count] : counts)
+      dropped[name] = {{"forwarded", count.forwarded}, {"unforwarded", count.unforwarded}};
+  }
   Json status = {{"device", device_},
                  {"consent", consent},
                  {"updated_at", unixNow()},
@@ -165,7 +199,8 @@ void Forwarder::writeStatus(const std::string& path, bool consent, double nextAt
                  {"failed_attempts", failures_},
                  {"next_attempt_at", time(nextAttempt)},
                  {"pruned_rows", pruned_},
-                 {"tables", std::move(tables)}};
+                 {"tables", std::move(tables)},
+                 {"dropped", std::move(dropped)}};
   const std::string text = status.dump(2, ' ', false, Json::error_handler_t::replace) + "\n";
   std::string tmp = path + ".XXXXXX";
   const int fd = mkstemp(tmp.data());

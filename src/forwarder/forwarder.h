@@ -1,6 +1,6 @@
 // One forwarding pass: every table's rows past its cursor, then the change log,
-// sent as batches back to back until nothing is left, and the state forwarder.json
-// shows.
+// sent as batches back to back until nothing is left, then the counts of rows the
+// disk quota deleted, and the state forwarder.json shows.
 #pragma once
 
 #include <cstdint>
@@ -43,6 +43,8 @@ class Forwarder {
   // False when there is no store yet, or (with error) when it cannot be opened.
   bool openStore(std::string* error);
   bool sendBatch(const char* table, const Batch& batch, std::string* error);
+  // The disk quota's dropped counts, when they grew since they were last sent.
+  bool sendDropped(std::string* error);
 
   const ForwarderConfig config_;
   const std::string device_;

@@ -244,6 +244,22 @@ TEST_F(ForwarderTest, RowsArriveIntactOnlyWithConsentAndSessionChangesShowInFina
   for (const char* t : {"telemetry_sessions", "telemetry_messages", "analytics_events", "energy_events", "store_changes"})
     EXPECT_EQ(s["tables"][t]["backlog"], 0) << t;
   EXPECT_TRUE(s["last_error"].is_null());
+
+  // The disk quota's counts go as they grow, the latest one per table in FINAL.
+  auto dropped = [&](const std::string& sql) {
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(dir.sub("state/vireo.db").c_str(), &db), SQLITE_OK);
+    sqlite3_busy_timeout(db, 5000);
+    EXPECT_EQ(sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << sqlite3_errmsg(db);
+    sqlite3_close(db);
+    ASSERT_EQ(runOnce(), 0) << forwarderLog();
+  };
+  const std::string finalDropped = "SELECT tbl, forwarded, unforwarded FROM fleet.store_dropped FINAL ORDER BY tbl";
+  dropped("INSERT INTO store_dropped VALUES ('analytics_events', 5, 2), ('energy_events', 0, 0)");
+  EXPECT_EQ(query(finalDropped), "analytics_events\t5\t2\n");
+  dropped("INSERT OR REPLACE INTO store_dropped VALUES ('analytics_events', 9, 2), ('energy_events', 0, 3)");
+  EXPECT_EQ(query(finalDropped), "analytics_events\t9\t2\nenergy_events\t0\t3\n");
+  EXPECT_EQ(status()["dropped"]["energy_events"]["unforwarded"], 3);
 }
 
 // Server killed and restarted under a running forwarder: rows written meanwhile
