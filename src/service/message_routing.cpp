@@ -22,7 +22,7 @@ std::string idsText(const std::optional<std::vector<std::int64_t>>& reporterIDs)
   if (!reporterIDs) return Value().text();
   Array ids;
   ids.reserve(reporterIDs->size());
-  for (std::int64_t id : *reporterIDs) ids.emplace_back(Value(std::int64_t{id}));
+  for (std::int64_t id : *reporterIDs) ids.emplace_back(id);
   return Value(std::move(ids)).text();
 }
 
