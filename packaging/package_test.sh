@@ -27,6 +27,10 @@ dpkg-deb -c "$deb" | awk '{ print $6 }' | sed 's|^\./|/|' >"$work/contents"
 for pattern in \
     '/usr/bin/vireo-reportingd' \
     '/usr/bin/vireoctl' \
+    '/usr/bin/vireo-forwarder' \
+    '/usr/lib/systemd/system/vireo-forwarder\.service' \
+    '/usr/share/vireo/clickhouse\.sql' \
+    '/usr/share/bash-completion/completions/vireoctl' \
     '/usr/lib[^ ]*/libvireo-client\.(so\.[0-9]+|a)' \
     '/usr/lib[^ ]*/pkgconfig/vireo-client\.pc' \
     '/usr/include/vireo/client\.h' \
@@ -47,6 +51,7 @@ done
 # The unit and the activation file must start a program the package installs.
 dpkg-deb -x "$deb" "$work/root"
 for file in usr/lib/systemd/system/vireo-reportingd.service \
+            usr/lib/systemd/system/vireo-forwarder.service \
             usr/share/dbus-1/system-services/com.orvane.vireo.Reporting1.service; do
     [ -f "$work/root/$file" ] || continue
     program=$(sed -n 's/^\(ExecStart\|Exec\)=\([^ ]*\).*/\2/p' "$work/root/$file")
