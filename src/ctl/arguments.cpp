@@ -41,12 +41,12 @@ std::optional<T> parseIntegral(std::string_view text) {
   }
 }
 
-struct Spec {
+struct OperationForm {
   const char* word;
   OpKind kind;
 };
 
-constexpr Spec kOps[] = {
+constexpr OperationForm kOps[] = {
     {"create", OpKind::Create},         {"set-service-type", OpKind::SetServiceType},
     {"service-type", OpKind::ServiceType}, {"configure", OpKind::Configure},
     {"start", OpKind::Start},           {"send", OpKind::Send},
@@ -247,7 +247,7 @@ std::optional<Operation> parseOperation(const std::vector<std::string>& w, std::
   }
   Operation op;
   op.name = w[0];
-  const Spec* entry = nullptr;
+  const OperationForm* entry = nullptr;
   for (const auto& s : kOps)
     if (w[0] == s.word) entry = &s;
   if (!entry) {
