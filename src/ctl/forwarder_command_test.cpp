@@ -47,21 +47,16 @@ TEST(ForwarderCommandTest, ShowsStoreCountsAndStatusFileAndCopesWithAnOlderStore
   sql("INSERT INTO forward_state VALUES ('analytics_events', 2); INSERT INTO store_dropped VALUES ('analytics_events', 4, 1)");
   dir.write("forwarder.json", R"({"device": "d1", "consent": false, "last_error": "HTTP 500", "last_error_at": 250.5,
                                   "next_attempt_at": null, "tables": {}})");
-  auto doc = nlohmann::json::parse(run(paths, {"--json"}));
-  EXPECT_EQ(doc["configured"], false);
-  EXPECT_EQ(doc["device"], "d1");
-  EXPECT_EQ(doc["consent"], false);
-  EXPECT_EQ(doc["last_error"], "HTTP 500");
-  EXPECT_EQ(doc["last_error_at"], 250.5);
-  EXPECT_TRUE(doc["last_success_at"].is_null());
-  const auto& analytics = doc["tables"]["analytics_events"];
-  EXPECT_EQ(analytics["cursor"], 2);
-  EXPECT_EQ(analytics["backlog"], 1);
-  EXPECT_EQ(analytics["dropped"]["forwarded"], 4);
-  EXPECT_EQ(analytics["dropped"]["unforwarded"], 1);
-  EXPECT_EQ(doc["tables"]["energy_events"]["backlog"], 1);
-  EXPECT_EQ(doc["tables"]["store_changes"]["cursor"], 0);
-
+  using Json = nlohmann::json;
+  auto expectFields = [&](const std::vector<std::pair<const char*, Json>>& fields) {
+    Json doc = Json::parse(run(paths, {"--json"}));
+    for (const auto& [pointer, value] : fields) EXPECT_EQ(doc[Json::json_pointer(pointer)], value) << pointer;
+  };
+  expectFields({{"/configured", false}, {"/device", "d1"}, {"/consent", false}, {"/last_error", "HTTP 500"},
+                {"/last_error_at", 250.5}, {"/last_success_at", nullptr}, {"/tables/analytics_events/cursor", 2},
+                {"/tables/analytics_events/backlog", 1}, {"/tables/analytics_events/dropped/forwarded", 4},
+                {"/tables/analytics_events/dropped/unforwarded", 1}, {"/tables/energy_events/backlog", 1},
+                {"/tables/store_changes/cursor", 0}});
   dir.write("forwarder.conf", "URL=http://x/\n");
   std::string text = run(paths, {});
   EXPECT_NE(text.find("forwarder     configured ("), std::string::npos) << text;
@@ -69,11 +64,8 @@ TEST(ForwarderCommandTest, ShowsStoreCountsAndStatusFileAndCopesWithAnOlderStore
 
   std::remove(paths.status.c_str());
   sql("DROP TABLE forward_state; DROP TABLE store_dropped; DROP TABLE store_changes");
-  doc = nlohmann::json::parse(run(paths, {"--json"}));
-  EXPECT_TRUE(doc["status_file"].is_null());
-  EXPECT_EQ(doc["tables"]["analytics_events"]["cursor"], 0);
-  EXPECT_EQ(doc["tables"]["analytics_events"]["backlog"], 3);
-  EXPECT_EQ(doc["tables"]["analytics_events"]["dropped"]["forwarded"], 0);
+  expectFields({{"/status_file", nullptr}, {"/tables/analytics_events/cursor", 0},
+                {"/tables/analytics_events/backlog", 3}, {"/tables/analytics_events/dropped/forwarded", 0}});
   run({dir.sub("missing.db"), paths.status, paths.config}, {}, 1);
   run(paths, {"--db"}, 2);
 }

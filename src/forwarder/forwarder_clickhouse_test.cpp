@@ -2,15 +2,10 @@
 // loopback ports in a temporary directory. The store is written by the daemon's
 // own store code.
 #include <arpa/inet.h>
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
-#include <signal.h>
-#include <spawn.h>
 #include <sqlite3.h>
 #include <sys/socket.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <chrono>
 #include <ctime>
@@ -21,18 +16,18 @@
 #include <thread>
 #include <vector>
 
+#include "fakes/child_process.h"
 #include "fakes/fake_platform.h"
 #include "fakes/temp_dir.h"
 #include "forwarder/clickhouse.h"
 #include "platform/linux/store/store.h"
-
-extern char** environ;
 
 namespace vireo {
 namespace {
 
 using namespace std::chrono_literals;
 using Json = nlohmann::json;
+using Env = std::map<std::string, std::string>;
 
 std::string serverPath() {
   for (const char* p : {"/usr/sbin/clickhouse-server", "/usr/bin/clickhouse-server"})
@@ -49,29 +44,6 @@ int freePort() {
   getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len);
   close(fd);
   return ntohs(a.sin_port);
-}
-
-pid_t spawn(const std::vector<std::string>& args, const std::vector<std::string>& env, const std::string& output) {
-  std::vector<char*> argv, envp;
-  for (const auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-  argv.push_back(nullptr);
-  for (char** e = environ; *e; ++e) envp.push_back(*e);
-  for (const auto& e : env) envp.push_back(const_cast<char*>(e.c_str()));
-  envp.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 1, output.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
-  posix_spawn_file_actions_adddup2(&actions, 1, 2);
-  pid_t pid = -1;
-  posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), envp.data());
-  posix_spawn_file_actions_destroy(&actions);
-  return pid;
-}
-
-int waitExit(pid_t pid) {
-  int status = 0;
-  waitpid(pid, &status, 0);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
 class ForwarderTest : public ::testing::Test {
@@ -108,15 +80,14 @@ class ForwarderTest : public ::testing::Test {
                                          "/\nUser=fleet\nPasswordFile=password\nDatabase=fleet\n" + extra);
   }
   void startServer() {
-    server = spawn({server_path, "--config-file=" + dir.sub("ch/config.xml")}, {}, dir.sub("ch/stdout.log"));
+    server = std::make_unique<itest::ChildProcess>();
+    server->start({server_path, "--config-file=" + dir.sub("ch/config.xml")}, {}, dir.sub("ch/stdout.log"));
     for (int i = 0; i < 300 && query("SELECT 1") != "1\n"; ++i) std::this_thread::sleep_for(50ms);
     ASSERT_EQ(query("SELECT 1"), "1\n") << "clickhouse-server did not start";
   }
   void stopServer() {  // as abruptly as it can end
-    if (server <= 0) return;
-    kill(server, SIGKILL);
-    waitExit(server);
-    server = -1;
+    if (server) server->signal(SIGKILL);
+    server.reset();
   }
   // The answer, or "ERROR ..." when the status is not 200.
   std::string query(const std::string& sql) {
@@ -130,14 +101,16 @@ class ForwarderTest : public ::testing::Test {
     return text.starts_with("ERROR") ? -1 : std::stoll(text);
   }
 
-  std::vector<std::string> forwarderEnv(std::vector<std::string> extra = {}) {
-    extra.insert(extra.end(), {"CONFIGURATION_DIRECTORY=" + dir.sub("conf"), "STATE_DIRECTORY=" + dir.sub("state"),
-                               "VIREO_FORWARDER_DEVICE=test-device", "JOURNAL_STREAM="});
-    return extra;
+  bool startForwarder(itest::ChildProcess& p, std::vector<std::string> args, Env env = {}) {
+    env.merge(Env{{"CONFIGURATION_DIRECTORY", dir.sub("conf")}, {"STATE_DIRECTORY", dir.sub("state")},
+                  {"VIREO_FORWARDER_DEVICE", "test-device"}, {"JOURNAL_STREAM", ""}});
+    args.insert(args.begin(), VIREO_FORWARDER_PATH);
+    return p.start(args, env, dir.sub("forwarder.log"));
   }
-  int runOnce(std::vector<std::string> env = {}) {
+  int runOnce(Env env = {}) {
     EXPECT_TRUE(store->flush(5s));
-    return waitExit(spawn({VIREO_FORWARDER_PATH, "--once"}, forwarderEnv(std::move(env)), dir.sub("forwarder.log")));
+    itest::ChildProcess p;
+    return startForwarder(p, {"--once"}, std::move(env)) ? p.waitExit(60s).value_or(-1) : -1;
   }
   std::string forwarderLog() const { return (std::stringstream() << std::ifstream(dir.sub("forwarder.log")).rdbuf()).str(); }
   Json status() const {
@@ -213,12 +186,13 @@ class ForwarderTest : public ::testing::Test {
   std::unique_ptr<linux_platform::LocalStore> store;
   const std::string server_path = serverPath();
   int port = 0;
-  pid_t server = -1;
+  std::unique_ptr<itest::ChildProcess> server;
 };
 
-// Nothing leaves while reporting is disabled; then every row arrives intact, and
-// changes to rows already sent show in FINAL.
-TEST_F(ForwarderTest, RowsArriveIntactOnlyWithConsentAndSessionChangesShowInFinal) {
+// Nothing leaves while reporting is disabled; then every row arrives intact, once
+// even when the forwarder dies between send and cursor, and changes to rows already
+// sent show in FINAL.
+TEST_F(ForwarderTest, RowsArriveIntactOnceOnlyWithConsentAndSessionChangesShowInFinal) {
   writeRows(150);
   dir.write("conf/com.orvane.vireo.conf", "disable_reporting = Yes\n");
   ASSERT_EQ(runOnce(), 0) << forwarderLog();
@@ -226,8 +200,15 @@ TEST_F(ForwarderTest, RowsArriveIntactOnlyWithConsentAndSessionChangesShowInFina
   EXPECT_EQ(status()["consent"], false);
   EXPECT_EQ(status()["tables"]["energy_events"]["backlog"], 150);
   dir.write("conf/com.orvane.vireo.conf", "disable_reporting = off\n");
+  // The process dies after the server took a batch and before its cursor is stored:
+  // the batch goes again and collapses.
+  ASSERT_EQ(runOnce({{"VIREO_FORWARDER_EXIT_AFTER_SEND", "1"}}), 70) << forwarderLog();
+  EXPECT_EQ(count("telemetry_sessions", false), 100);
   ASSERT_EQ(runOnce(), 0) << forwarderLog();
   expectSameRows();
+  EXPECT_LE(count("telemetry_sessions", false), 250);  // less once a background merge collapsed them
+  query("OPTIMIZE TABLE fleet.telemetry_sessions FINAL");
+  EXPECT_EQ(count("telemetry_sessions", false), 150);
   const double flushedAt = static_cast<double>(std::time(nullptr)) + 0.25;
   for (std::int64_t id = 1; id <= 150; id += 7) {
     store->setBackends(id, std::vector<std::string>{"local", "late"});
@@ -267,7 +248,8 @@ TEST_F(ForwarderTest, RowsArriveIntactOnlyWithConsentAndSessionChangesShowInFina
 TEST_F(ForwarderTest, BacklogFromAnOutageArrivesOnce) {
   writeConfig("BatchRows=100\nInterval=1\n");
   writeRows(50);
-  const pid_t forwarder = spawn({VIREO_FORWARDER_PATH}, forwarderEnv(), dir.sub("forwarder.log"));
+  itest::ChildProcess forwarder;
+  ASSERT_TRUE(startForwarder(forwarder, {}));
   auto waitFor = [&](long long analytics) {
     for (int i = 0; i < 300 && count("analytics_events", true) != analytics; ++i) std::this_thread::sleep_for(100ms);
     return count("analytics_events", true);
@@ -286,23 +268,10 @@ TEST_F(ForwarderTest, BacklogFromAnOutageArrivesOnce) {
   startServer();
   ASSERT_EQ(waitFor(450), 450) << forwarderLog();
   for (int i = 0; i < 100 && status()["tables"]["store_changes"]["backlog"] != 0; ++i) std::this_thread::sleep_for(100ms);
-  kill(forwarder, SIGTERM);
-  EXPECT_EQ(waitExit(forwarder), 0);
+  forwarder.signal(SIGTERM);
+  EXPECT_EQ(forwarder.waitExit(20s), 0);
   expectSameRows();
   for (const char* table : kTables) EXPECT_LE(count(table, false) - count(table, true), 100) << table;
-}
-
-// The process dies after the server took a batch and before its cursor is stored:
-// the batch goes again and collapses.
-TEST_F(ForwarderTest, KilledBeforeItsCursorIsStoredShowsNoDuplicate) {
-  writeRows(120);
-  ASSERT_EQ(runOnce({"VIREO_FORWARDER_EXIT_AFTER_SEND=1"}), 70) << forwarderLog();
-  EXPECT_EQ(count("telemetry_sessions", false), 100);
-  ASSERT_EQ(runOnce(), 0) << forwarderLog();
-  expectSameRows();
-  EXPECT_LE(count("telemetry_sessions", false), 220);  // less once a background merge collapsed them
-  query("OPTIMIZE TABLE fleet.telemetry_sessions FINAL");
-  EXPECT_EQ(count("telemetry_sessions", false), 120);
 }
 
 }  // namespace

@@ -5,6 +5,7 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -41,8 +42,7 @@ class CtlTest : public ServiceTest {
  protected:
   CtlRun ctl(std::vector<std::string> args, const std::string& input = "",
              std::map<std::string, std::string> env = {}) {
-    std::string inputFile = dir_ + "/ctl-input";
-    std::string errFile = dir_ + "/ctl-stderr";
+    const std::string inputFile = dir_ + "/ctl-input", errFile = dir_ + "/ctl-stderr";
     writeFile(inputFile, input);
     ::unlink(errFile.c_str());
     std::vector<std::string> argv{"/bin/sh", "-c", "exec \"$0\" \"$@\" < " + inputFile, VIREOCTL_PATH};
@@ -54,8 +54,7 @@ class CtlTest : public ServiceTest {
                                                  {"VIREO_BUS", "session"},
                                                  {"CONFIGURATION_DIRECTORY", configDir_},
                                                  {"STATE_DIRECTORY", stateDir_}});
-    if (!p.start(argv, env, errFile, &fd))
-      return run;
+    if (!p.start(argv, env, errFile, &fd)) return run;
     char buf[4096];
     ssize_t n;
     while ((n = ::read(fd, buf, sizeof buf)) > 0) run.out.append(buf, static_cast<size_t>(n));
@@ -83,9 +82,8 @@ TEST_F(CtlTest, SequencesScriptsStoreQueriesAndTheReportingSwitch) {
   EXPECT_EQ(lines[2]["serviceType"], 2);
   EXPECT_EQ(lines[3]["pending"], true);
   EXPECT_EQ(lines[5]["reporterIDs"], nlohmann::json::array({5}));
-  bool answered = false;
-  for (const auto& l : lines) answered = answered || (l.contains("answered") && l["answered"] == true);
-  EXPECT_TRUE(answered) << r.out;
+  EXPECT_TRUE(std::ranges::any_of(lines, [](auto& l) { return l.contains("answered") && l["answered"] == true; }))
+      << r.out;
   EXPECT_EQ(lines.back()["serviceType"], 2);
 
   r = ctl({"-"}, "create 9  # first\nstart 9\nsleep 0.1\nstop 9\nwait-start 9 5\nlist\n");
@@ -102,24 +100,17 @@ TEST_F(CtlTest, SequencesScriptsStoreQueriesAndTheReportingSwitch) {
                  "--", "stop", "4"})
                 .status,
             0);
-  nlohmann::json rowsJson;
-  ASSERT_TRUE(eventually(
-      [&] {
-        rowsJson = nlohmann::json::parse(ctl({"messages", "--json", "--since", "2000-01-01T00:00:00Z"}).out, nullptr,
-                                         false);
-        for (const auto& row : rowsJson)
-          if (row["category"] == 2) return true;
-        return false;
-      },
-      15s));
-  for (const auto& row : rowsJson) {
-    if (row["category"] != 2) continue;
-    EXPECT_EQ(row["payload"]["n"], 7);
-    EXPECT_EQ(row["payload"]["x"], 1.5);
-  }
+  nlohmann::json row;
+  ASSERT_TRUE(eventually([&] {
+    auto out = ctl({"messages", "--json", "--since", "2000-01-01T00:00:00Z"}).out;
+    for (const auto& each : nlohmann::json::parse(out, nullptr, false))
+      if (each["category"] == 2) return (row = each), true;
+    return false;
+  }, 15s));
+  EXPECT_EQ(row["payload"]["n"], 7);
+  EXPECT_EQ(row["payload"]["x"], 1.5);
   auto sessions = nlohmann::json::parse(ctl({"sessions", "--json", "--limit", "1"}).out, nullptr, false);
-  ASSERT_TRUE(sessions.is_array());
-  ASSERT_EQ(sessions.size(), 1u);
+  ASSERT_TRUE(sessions.is_array() && sessions.size() == 1) << sessions;
   EXPECT_TRUE(sessions[0]["user_info"].is_object());
   EXPECT_EQ(ctl({"analytics", "--session", "1"}).status, 2);
   // The defaults suite with its notification switches reporting off and on.

@@ -1,95 +1,16 @@
 #include "service_fixture.h"
 
-#include <fcntl.h>
-#include <signal.h>
 #include <sqlite3.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 
-extern char** environ;
-
 namespace vireo::itest {
 
 namespace fs = std::filesystem;
-
-ChildProcess::~ChildProcess() { stop(); }
-
-bool ChildProcess::start(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
-                         const std::string& outputFile, int* stdoutPipe) {
-  // Built before the fork: the child only calls what is safe after forking a threaded process.
-  std::map<std::string, std::string> merged;
-  for (char** e = environ; *e; ++e)
-    if (const char* eq = std::strchr(*e, '=')) merged.emplace(std::string(*e, eq - *e), eq + 1);
-  for (const auto& [k, v] : env)
-    if (v.empty()) merged.erase(k);
-    else merged[k] = v;
-  std::vector<std::string> argvCopy = argv, envStrings;
-  for (const auto& [k, v] : merged) envStrings.push_back(k + "=" + v);
-  std::vector<char*> args, envp;
-  for (auto& s : argvCopy) args.push_back(s.data());
-  for (auto& s : envStrings) envp.push_back(s.data());
-  args.push_back(nullptr);
-  envp.push_back(nullptr);
-
-  int pipeFds[2] = {-1, -1};
-  if (stdoutPipe && pipe2(pipeFds, O_CLOEXEC) != 0) return false;
-  int out = ::open(outputFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-  if (out < 0) return false;
-  pid_ = fork();
-  if (pid_ == 0) {
-    dup2(out, STDERR_FILENO);
-    dup2(stdoutPipe ? pipeFds[1] : out, STDOUT_FILENO);
-    int devnull = ::open("/dev/null", O_RDONLY);
-    dup2(devnull, STDIN_FILENO);
-    execve(args[0], args.data(), envp.data());
-    _exit(127);
-  }
-  ::close(out);
-  if (stdoutPipe) {
-    ::close(pipeFds[1]);
-    *stdoutPipe = pipeFds[0];
-  }
-  status_.reset();
-  return pid_ > 0;
-}
-
-bool ChildProcess::running() { return pid_ > 0 && !waitExit(0ms).has_value(); }
-
-std::optional<int> ChildProcess::waitExit(std::chrono::milliseconds timeout) {
-  if (status_) return status_;
-  if (pid_ <= 0) return std::nullopt;
-  auto until = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    int st = 0;
-    pid_t r = waitpid(pid_, &st, WNOHANG);
-    if (r == pid_) {
-      status_ = WIFEXITED(st) ? WEXITSTATUS(st) : 128 + WTERMSIG(st);
-      return status_;
-    }
-    if (r < 0) return std::nullopt;
-    if (std::chrono::steady_clock::now() >= until) return std::nullopt;
-    std::this_thread::sleep_for(5ms);
-  }
-}
-
-void ChildProcess::signal(int sig) {
-  if (pid_ > 0 && !status_) ::kill(pid_, sig);
-}
-
-void ChildProcess::stop() {
-  if (pid_ <= 0 || status_) return;
-  signal(SIGTERM);
-  if (!waitExit(10s)) {
-    signal(SIGKILL);
-    waitExit(5s);
-  }
-}
 
 std::string ServiceTest::startPrivateBus(ChildProcess& bus, const std::string& dir) {
   int fd = -1;

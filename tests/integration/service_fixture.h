@@ -4,7 +4,6 @@
 #pragma once
 
 #include <gtest/gtest.h>
-#include <sys/types.h>
 
 #include <chrono>
 #include <cstdint>
@@ -17,29 +16,12 @@
 
 #include <nlohmann/json.hpp>
 
+#include "../fakes/child_process.h"
 #include "vireo/client.h"
 
 namespace vireo::itest {
 
 using namespace std::chrono_literals;
-
-// A child process started with its own environment and stdout+stderr in a file.
-class ChildProcess {
- public:
-  ChildProcess() = default;
-  ~ChildProcess();
-  bool start(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
-             const std::string& outputFile, int* stdoutPipe = nullptr);
-  bool running();
-  // Exit status (WEXITSTATUS, or 128+signal), nothing when it did not end in time.
-  std::optional<int> waitExit(std::chrono::milliseconds timeout);
-  void signal(int sig);
-  void stop();  // SIGTERM, then SIGKILL after a grace period
-
- private:
-  pid_t pid_ = -1;
-  std::optional<int> status_;
-};
 
 class ServiceTest : public ::testing::Test {
  protected:
