@@ -41,6 +41,7 @@ for pattern in \
     '/usr/share/dbus-1/system-services/com\.orvane\.vireo\.Reporting1\.service' \
     '/usr/share/dbus-1/interfaces/com\.orvane\.vireo\.Reporting1\.xml' \
     '/usr/share/man/man8/vireo-reportingd\.8\.gz' \
+    '/usr/share/man/man8/vireo-forwarder\.8\.gz' \
     '/usr/share/man/man1/vireoctl\.1\.gz' \
     '/usr/share/man/man5/vireo\.conf\.5\.gz' \
     '/usr/share/doc/vireo/copyright' \
