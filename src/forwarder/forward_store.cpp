@@ -6,6 +6,7 @@
 #include <nlohmann/json.hpp>
 
 #include "platform/linux/store/change_log.h"
+#include "platform/linux/store/sqlite_statement.h"
 
 namespace vireo::forwarder {
 
@@ -20,33 +21,7 @@ constexpr double kSessionGapWait = 30;
 // Rows deleted per pruning transaction.
 constexpr int kPruneChunk = 500;
 
-class Statement {
- public:
-  Statement(sqlite3* db, const std::string& sql) { ok_ = sqlite3_prepare_v2(db, sql.c_str(), -1, &s_, nullptr) == SQLITE_OK; }
-  ~Statement() { sqlite3_finalize(s_); }
-  Statement(const Statement&) = delete;
-  Statement& operator=(const Statement&) = delete;
-  bool ok() const { return ok_; }
-  Statement& bind(int i, std::int64_t v) {
-    ok_ = ok_ && sqlite3_bind_int64(s_, i, v) == SQLITE_OK;
-    return *this;
-  }
-  Statement& bind(int i, double v) {
-    ok_ = ok_ && sqlite3_bind_double(s_, i, v) == SQLITE_OK;
-    return *this;
-  }
-  Statement& bind(int i, std::string_view v) {
-    ok_ = ok_ && sqlite3_bind_text64(s_, i, v.data(), v.size(), SQLITE_TRANSIENT, SQLITE_UTF8) == SQLITE_OK;
-    return *this;
-  }
-  // SQLITE_ROW, SQLITE_DONE or an error.
-  int step() { return ok_ ? sqlite3_step(s_) : SQLITE_ERROR; }
-  sqlite3_stmt* get() const { return s_; }
-
- private:
-  sqlite3_stmt* s_ = nullptr;
-  bool ok_ = false;
-};
+using Statement = linux_platform::SqliteStatement;
 
 Json columnValue(sqlite3_stmt* s, int i, const ForwardedColumn& column) {
   if (sqlite3_column_type(s, i) == SQLITE_NULL) {

@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "platform/linux/key_file.h"
+#include "platform/linux/store/sqlite_statement.h"
 
 namespace vireo::linux_platform {
 
@@ -21,29 +22,7 @@ constexpr Table kTables[] = {{"telemetry_messages", "sent_at"},
                              {"energy_events", "at"},
                              {"telemetry_sessions", "created_at"}};
 
-class Statement {
- public:
-  Statement(sqlite3* db, const std::string& sql) {
-    if (sqlite3_prepare_v2(db, sql.c_str(), -1, &s_, nullptr) != SQLITE_OK) s_ = nullptr;
-  }
-  ~Statement() { sqlite3_finalize(s_); }
-  Statement(const Statement&) = delete;
-  Statement& operator=(const Statement&) = delete;
-
-  Statement& bind(int i, std::int64_t v) {
-    if (s_) sqlite3_bind_int64(s_, i, v);
-    return *this;
-  }
-  Statement& bind(int i, const char* v) {
-    if (s_) sqlite3_bind_text(s_, i, v, -1, SQLITE_STATIC);
-    return *this;
-  }
-  int step() { return s_ ? sqlite3_step(s_) : SQLITE_ERROR; }
-  sqlite3_stmt* get() const { return s_; }
-
- private:
-  sqlite3_stmt* s_ = nullptr;
-};
+using Statement = SqliteStatement;
 
 // The first column of the first row, or 0 when there is none (or it is NULL).
 std::optional<std::int64_t> scalar(Statement& s) {
@@ -76,7 +55,7 @@ std::optional<std::uint64_t> deleteChunk(sqlite3* db, const Table& t, std::int64
   const bool spare = spareOpenSessions && name == "telemetry_sessions";
   Statement del(db, "DELETE FROM " + name + " WHERE id IN (SELECT id FROM " + name + " WHERE id <= ?1" +
                         (spare ? " AND flushed_at IS NOT NULL" : "") + " ORDER BY id LIMIT ?2)");
-  if (del.bind(1, upTo).bind(2, kQuotaChunk).step() != SQLITE_DONE) return std::nullopt;
+  if (del.bind(1, upTo).bind(2, std::int64_t{kQuotaChunk}).step() != SQLITE_DONE) return std::nullopt;
   const auto n = static_cast<std::uint64_t>(sqlite3_changes(db));
   if (n == 0) return n;
   Statement count(db, std::string("INSERT INTO store_dropped (tbl, ") + column + ") VALUES (?1, ?2) " +
